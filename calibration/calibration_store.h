@@ -1,0 +1,6 @@
+// Command 6: run and store the calibration of one sensor.
+#pragma once
+
+#include <stdint.h>
+
+int store_calib_data(const uint8_t* frame);

@@ -1,0 +1,42 @@
+// Host side of the platform interface: netlink protocol NETLINK_USERSOCK, the kernel played by
+// whoever binds KESTREL_KERNEL_PORT, paths under KESTREL_SYSROOT and delays scaled by
+// KESTREL_TIME_SCALE.
+#include <linux/netlink.h>
+#include <stdio.h>
+#include <time.h>
+
+#include "host_env.h"
+#include "kestrel_platform.h"
+
+int platform_netlink_protocol(void) { return NETLINK_USERSOCK; }
+
+uint32_t platform_kernel_port_id(void) { return host_environment().kernel_port; }
+
+const char* platform_path(const char* path, char* buf, size_t size) {
+  snprintf(buf, size, "%s%s", host_environment().sysroot, path);
+  return buf;
+}
+
+uint64_t platform_scaled_microseconds(uint64_t microseconds) {
+  return static_cast<uint64_t>(static_cast<double>(microseconds) * host_environment().time_scale);
+}
+
+namespace {
+
+void sleep_microseconds(uint64_t us) {
+  struct timespec ts;
+  ts.tv_sec = static_cast<time_t>(us / 1000000);
+  ts.tv_nsec = static_cast<long>((us % 1000000) * 1000);
+  while (nanosleep(&ts, &ts) != 0) {
+  }
+}
+
+}  // namespace
+
+void platform_sleep_seconds(unsigned seconds) {
+  sleep_microseconds(platform_scaled_microseconds(uint64_t{seconds} * 1000000));
+}
+
+void platform_sleep_milliseconds(unsigned milliseconds) {
+  sleep_microseconds(platform_scaled_microseconds(uint64_t{milliseconds} * 1000));
+}

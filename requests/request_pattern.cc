@@ -1,0 +1,68 @@
+#include "request_pattern.h"
+
+#include <stdlib.h>
+#include <string.h>
+
+#include "kestrel_log.h"
+#include "service_link/connection.h"
+#include "service_link/response_waiter.h"
+
+bool begin_request(sensor1_request* req, const char* name, int32_t handle_arg, uint32_t service,
+                   int32_t msg_id, uint16_t size, uint8_t txn_id, alloc_failure_text text) {
+  req->name = name;
+  req->handle = get_handle_for_sensor(handle_arg);
+  req->header.service_number = service;
+  req->header.msg_id = msg_id;
+  req->header.msg_size = size;
+  req->header.txn_id = txn_id;
+  req->body = nullptr;
+  const int r = sensor1_alloc_msg_buf(req->handle, size, &req->body);
+  if (r != SENSOR1_SUCCESS || req->body == nullptr) {
+    switch (text) {
+      case alloc_failure_text::kBracketed:
+        KLOGE("[%s]sensor1_alloc_msg_buf error - %d\n", name, r);
+        break;
+      case alloc_failure_text::kGetRaw:
+        KLOGE("get_raw error get_raw_data returned %d\n", r);
+        break;
+      case alloc_failure_text::kPlain:
+        KLOGE("%s sensor1_alloc_msg_buf error:%d\n", name, r);
+        break;
+    }
+    req->body = nullptr;
+    return false;
+  }
+  // Only the listed fields of a request are meaningful; the rest is sent as zeros.
+  memset(req->body, 0, size);
+  return true;
+}
+
+int write_request(sensor1_request* req) {
+  const int r = sensor1_write(req->handle, &req->header, req->body);
+  if (r == SENSOR1_SUCCESS || r == SENSOR1_EWOULDBLOCK) return 0;
+  sensor1_free_msg_buf(req->handle, req->body);
+  req->body = nullptr;
+  return r;
+}
+
+bool write_request_or_close(sensor1_request* req) {
+  const int r = sensor1_write(req->handle, &req->header, req->body);
+  if (r == SENSOR1_SUCCESS || r == SENSOR1_EWOULDBLOCK) return true;
+  KLOGE("[%s]sensor1_write -error  %d\n", req->name, r);
+  sensor1_free_msg_buf(req->handle, req->body);
+  req->body = nullptr;
+  // The handle is emptied with the close, so the next request opens a new connection instead of
+  // writing on a closed one.
+  const int closed = close_and_forget_handle(req->handle);
+  if (closed != 0) {
+    KLOGE("sensor1_close returned %d\n", closed);
+    exit(closed);
+  }
+  return false;
+}
+
+int32_t wait_for_answer(const char* name) {
+  const int32_t r = wait_for_response();
+  if (r == 0) KLOGE("%s: ERROR: No response for command", name);
+  return r;
+}
