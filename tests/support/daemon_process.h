@@ -1,0 +1,48 @@
+// Runs kestreld as a child process (in the test's own network namespace) and reads its log
+// records from its stderr, as Debian's liblog writes them:
+//   KESTRELD <P> <MM-DD> <HH:MM:SS> <pid> <tid> <message>
+#pragma once
+
+#include <sys/types.h>
+
+#include <chrono>
+#include <map>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "log_capture.h"
+
+class DaemonProcess {
+ public:
+  // Starts the daemon with the test's environment plus env (a value of "" unsets a variable).
+  // path_prepend goes before PATH (the recording stand-ins of shell tools).
+  explicit DaemonProcess(const std::map<std::string, std::string>& env = {},
+                         const std::string& path_prepend = "");
+  ~DaemonProcess();  // kills the daemon if it still runs
+  DaemonProcess(const DaemonProcess&) = delete;
+  DaemonProcess& operator=(const DaemonProcess&) = delete;
+
+  pid_t pid() const { return pid_; }
+
+  std::vector<LogRecord> records() const;
+  std::vector<std::string> messages(const std::string& tag = "KESTRELD") const;
+  size_t count(const std::string& message, const std::string& tag = "KESTRELD") const;
+  bool wait_for(const std::string& message, std::chrono::milliseconds timeout, size_t n = 1,
+                const std::string& tag = "KESTRELD") const;
+  // Everything the daemon wrote to stderr, for failure messages.
+  std::string output() const;
+
+  // Exit status once the process has ended within timeout (-signal when killed).
+  std::optional<int> wait_exit(std::chrono::milliseconds timeout);
+  void kill_now();
+
+ private:
+  struct State;
+  State* state_;
+  pid_t pid_ = -1;
+};
+
+// Time scale the end-to-end tests run the daemon at, and a nominal duration at that scale.
+double test_time_scale();
+std::chrono::milliseconds scaled(std::chrono::milliseconds nominal);

@@ -1,0 +1,30 @@
+// Captures every record logged in this process through liblog, by installing a logger.
+#pragma once
+
+#include <chrono>
+#include <string>
+#include <vector>
+
+struct LogRecord {
+  int priority;  // 4 info, 5 warning, 6 error
+  std::string tag;
+  std::string message;
+};
+
+// One at a time per process. Records of every thread are kept in order of logging.
+class LogCapture {
+ public:
+  LogCapture();
+  ~LogCapture();
+  LogCapture(const LogCapture&) = delete;
+  LogCapture& operator=(const LogCapture&) = delete;
+
+  std::vector<LogRecord> records() const;
+  // Messages of one tag, in order.
+  std::vector<std::string> messages(const std::string& tag = "KESTRELD") const;
+  size_t count(const std::string& message, const std::string& tag = "KESTRELD") const;
+  // Waits until at least n records of tag carry exactly message.
+  bool wait_for(const std::string& message, std::chrono::milliseconds timeout, size_t n = 1,
+                const std::string& tag = "KESTRELD") const;
+  void clear();
+};

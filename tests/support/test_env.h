@@ -1,0 +1,33 @@
+// The environment every test binary runs in. test_main sets it before anything reads it, so
+// in-process code and the daemons a test starts see the same files:
+//   KESTREL_SENSOR1_SOCKET, KESTREL_PROPERTIES, KESTREL_SENSOR_REG and KESTREL_SYSROOT name
+//   files and a directory private to this test process; KESTREL_KERNEL_PORT is 100 and
+//   KESTREL_TIME_SCALE 0.05 unless the test's command line environment sets it.
+#pragma once
+
+#include <string>
+#include <vector>
+
+std::string test_socket_path();
+std::string test_properties_path();
+std::string test_registry_path();
+std::string test_sysroot();
+
+// Writes a whole file (the parent directories are created).
+void write_file(const std::string& path, const std::string& text);
+void remove_file(const std::string& path);
+
+// Recording stand-ins for the shell tools the daemon runs: chown, chmod and diag_mdlog. Each
+// call appends "<tool> <args>" as one line to a record file. Put dir() first on PATH.
+class FakeTools {
+ public:
+  FakeTools();
+  ~FakeTools();
+  const std::string& dir() const { return dir_; }
+  std::vector<std::string> calls() const;
+  // Waits until at least n calls are recorded.
+  bool wait_for_calls(size_t n, int timeout_ms) const;
+
+ private:
+  std::string dir_;
+};

@@ -1,0 +1,118 @@
+// kestrel-sim: the simulated sensor processor. It serves the sensor1 wire protocol of the host
+// build on a Unix stream socket. Tests drive it step by step (expect a request, answer it,
+// inject a fault, drop the connection, refuse opens); the kestrel-sim program runs it as a
+// healthy phone that answers every request of the daemon by itself.
+#pragma once
+
+#include <stdint.h>
+
+#include <array>
+#include <chrono>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace kestrel_sim {
+
+// Wire record kinds.
+enum RecordKind : uint8_t {
+  kOpen = 1,
+  kWrite = 2,
+  kFaultAck = 3,
+  kOpenResult = 64,
+  kResponse = 65,
+  kIndication = 66,
+  kRetryOpen = 67,
+  kFault = 68,
+  kCallback = 69,
+};
+
+enum class FaultOp : uint8_t { kAlloc = 1, kWrite = 2, kClose = 3 };
+
+struct Header {
+  uint32_t service = 0;
+  int32_t msg_id = 0;
+  uint16_t msg_size = 0;  // filled from the body when sent
+  uint8_t txn_id = 0;
+};
+
+// One sensor1_write of the daemon, as received.
+struct Request {
+  int connection = 0;  // 1 for the first connection of the simulator's life, then 2, ...
+  Header header;
+  std::vector<uint8_t> body;
+};
+
+using Millis = std::chrono::milliseconds;
+
+class Simulator {
+ public:
+  // Listens on socket_path (a stale file is removed). With healthy set it answers every request
+  // like a healthy phone (see healthy_phone.h); without it, only what a test tells it.
+  explicit Simulator(std::string socket_path, bool healthy = false);
+  ~Simulator();  // stops its threads, closes every connection and removes the socket file
+  Simulator(const Simulator&) = delete;
+  Simulator& operator=(const Simulator&) = delete;
+
+  const std::string& socket_path() const;
+
+  void set_healthy(bool healthy);
+
+  // The next count OPEN records are answered with result (11 EWOULDBLOCK, or any error code).
+  void refuse_opens(int32_t result, int count);
+
+  // Stops accepting (the socket file is removed, so sensor1_open gets 11) or starts again.
+  void stop_listening();
+  void resume_listening();
+
+  // Number of connections that completed the OPEN handshake with result 0, over the life.
+  int opened_connections() const;
+  // True once a connection is open (the current one), within timeout.
+  bool wait_for_connection(Millis timeout);
+  // True once the current connection has ended (closed by the library or dropped).
+  bool wait_for_disconnect(Millis timeout);
+
+  // Every WRITE received so far, in arrival order, and the next one not yet taken.
+  std::vector<Request> requests() const;
+  std::optional<Request> next_request(Millis timeout);
+  void clear_requests();
+
+  // Records to the current connection. msg_size of the header is set from the body.
+  void respond(Header header, const std::vector<uint8_t>& body);
+  void indicate(Header header, const std::vector<uint8_t>& body);
+  void retry_open();
+  // A callback of exactly this type; with_header / with_body clear give null pointers.
+  void callback(int32_t msg_type, bool with_header, bool with_body, Header header,
+                const std::vector<uint8_t>& body);
+  // The next count calls of op return result; waits for the FAULT_ACK. False on timeout.
+  bool fault(FaultOp op, int32_t result, uint32_t count, Millis timeout = Millis(2000));
+  // Closes the current connection from the simulator's side: the library sees end of file.
+  void drop_connection();
+
+  // Hook run for every WRITE before the healthy phone (if on) answers it; tests use it to answer
+  // a request at the moment it arrives. Runs on the simulator's connection thread.
+  using RequestHook = std::function<void(Simulator&, const Request&)>;
+  void set_request_hook(RequestHook hook);
+
+ private:
+  struct State;
+  std::unique_ptr<State> state_;
+};
+
+// Bodies of the sensor service, as the daemon reads them. Shared by the healthy phone and tests.
+// A single-sensor test indication (84 bytes): words go to offsets 20, 24, ... (at most 16).
+std::vector<uint8_t> test_indication_body(uint8_t sensor_id, int32_t test_type, uint32_t result,
+                                          uint8_t error_valid, uint8_t error_code,
+                                          const std::vector<int32_t>& words);
+// A sample indication (24 bytes).
+std::vector<uint8_t> sample_indication_body(uint8_t sensor_id, uint8_t data_type, int32_t x,
+                                            int32_t y, int32_t z);
+// A daf_indication (32 bytes).
+std::vector<uint8_t> daf_indication_body(uint8_t code, uint8_t valid, uint32_t length,
+                                         const std::array<int32_t, 6>& data);
+// A response of the common form: result, error, then zeros up to size bytes.
+std::vector<uint8_t> common_response_body(uint8_t result, uint8_t error, size_t size = 2);
+
+}  // namespace kestrel_sim
