@@ -45,7 +45,7 @@ int priority_of(char p) {
 
 }  // namespace
 
-DaemonProcess::DaemonProcess(const std::map<std::string, std::string>& env,
+DaemonProcess::DaemonProcess(const DaemonEnv& env,
                              const std::string& path_prepend)
     : state_(new State) {
   int fds[2];

@@ -13,11 +13,14 @@
 
 #include "log_capture.h"
 
+// Environment overrides of one daemon: DaemonProcess d(DaemonEnv{{"KESTREL_TIME_SCALE", "1"}}).
+using DaemonEnv = std::map<std::string, std::string>;
+
 class DaemonProcess {
  public:
   // Starts the daemon with the test's environment plus env (a value of "" unsets a variable).
   // path_prepend goes before PATH (the recording stand-ins of shell tools).
-  explicit DaemonProcess(const std::map<std::string, std::string>& env = {},
+  explicit DaemonProcess(const DaemonEnv& env = {},
                          const std::string& path_prepend = "");
   ~DaemonProcess();  // kills the daemon if it still runs
   DaemonProcess(const DaemonProcess&) = delete;

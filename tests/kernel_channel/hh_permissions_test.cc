@@ -1,0 +1,53 @@
+// Command 36: the four shell commands that repair the owner and mode of the light sensor's
+// coefficient files, each finished before the next, all between the two log lines.
+#include <android/log.h>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <stdlib.h>
+
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "kernel_channel/process_message.h"
+#include "kernel_peer.h"
+#include "test_env.h"
+
+using ::testing::ElementsAre;
+
+namespace {
+
+// Each log line together with the number of shell calls recorded at the moment it was logged.
+FakeTools* g_tools = nullptr;
+std::mutex g_mutex;
+std::vector<std::pair<std::string, size_t>> g_lines;
+
+void recording_logger(const struct __android_logger_data* data, const char* message) {
+  if (std::string(data->tag) != "KESTRELD") return;
+  std::lock_guard<std::mutex> lock(g_mutex);
+  g_lines.emplace_back(message, g_tools->calls().size());
+}
+
+TEST(HhFilePermissionsTest, RunsTheFourCommandsInOrderBetweenItsLines) {
+  FakeTools tools;
+  g_tools = &tools;
+  const std::string path = tools.dir() + ":" + getenv("PATH");
+  setenv("PATH", path.c_str(), 1);
+  __android_log_set_logger(recording_logger);
+
+  const std::vector<uint8_t> frame = command_frame(36);
+  std::vector<uint8_t> buffer(1024, 0);
+  std::copy(frame.begin(), frame.end(), buffer.begin());
+  process_message(buffer.data(), static_cast<int32_t>(frame.size()));
+
+  __android_log_set_logger(__android_log_stderr_logger);
+  EXPECT_THAT(tools.calls(), ElementsAre("chown system:radio /efs/FactoryApp/predefine*",
+                                         "chown system:radio /efs/FactoryApp/hh_version",
+                                         "chmod 660 /efs/FactoryApp/predefine*",
+                                         "chmod 660 /efs/FactoryApp/hh_version"));
+  using Line = std::pair<std::string, size_t>;
+  EXPECT_THAT(g_lines, ElementsAre(Line{"process_message: 36", 0}, Line{"chown : start \n", 0},
+                                   Line{"chown : end\n", 4}));
+}
+
+}  // namespace
