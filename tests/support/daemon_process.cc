@@ -9,7 +9,6 @@
 
 #include <condition_variable>
 #include <mutex>
-#include <regex>
 #include <thread>
 
 #ifndef KESTRELD_BINARY
@@ -41,6 +40,35 @@ int priority_of(char p) {
     case 'F': return 7;
     default: return 0;
   }
+}
+
+// Parses "<tag> <P> <MM-DD> <HH:MM:SS> <pid> <tid> <message>" (pid and tid padded with blanks).
+bool parse_record(const std::string& line, LogRecord* record) {
+  size_t pos = 0;
+  auto field = [&](std::string* out) {
+    while (pos < line.size() && line[pos] == ' ') ++pos;
+    const size_t start = pos;
+    while (pos < line.size() && line[pos] != ' ') ++pos;
+    if (pos == start) return false;
+    *out = line.substr(start, pos - start);
+    return true;
+  };
+  std::string tag, prio, date, time, pid, tid;
+  if (!field(&tag) || !field(&prio) || !field(&date) || !field(&time) || !field(&pid) ||
+      !field(&tid)) {
+    return false;
+  }
+  if (prio.size() != 1 || priority_of(prio[0]) == 0 || date.size() != 5 || date[2] != '-' ||
+      time.size() != 8 || time[2] != ':' || time[5] != ':' ||
+      pid.find_first_not_of("0123456789") != std::string::npos ||
+      tid.find_first_not_of("0123456789") != std::string::npos) {
+    return false;
+  }
+  // Exactly one blank separates the thread id from the message, which may start with blanks.
+  record->tag = tag;
+  record->priority = priority_of(prio[0]);
+  record->message = pos < line.size() ? line.substr(pos + 1) : "";
+  return true;
 }
 
 }  // namespace
@@ -79,8 +107,6 @@ DaemonProcess::DaemonProcess(const DaemonEnv& env,
   state_->read_fd = fds[0];
   State* st = state_;
   state_->reader = std::thread([st] {
-    static const std::regex kRecord(
-        R"(^(\S+) ([VDIWEF]) \d\d-\d\d \d\d:\d\d:\d\d\s+\d+\s+\d+ (.*)$)");
     std::string pending;
     char buf[4096];
     for (;;) {
@@ -93,9 +119,9 @@ DaemonProcess::DaemonProcess(const DaemonEnv& env,
       while ((nl = pending.find('\n')) != std::string::npos) {
         std::string line = pending.substr(0, nl);
         pending.erase(0, nl + 1);
-        std::smatch m;
-        if (std::regex_match(line, m, kRecord)) {
-          st->records.push_back({priority_of(m[2].str()[0]), m[1].str(), m[3].str()});
+        LogRecord record;
+        if (parse_record(line, &record)) {
+          st->records.push_back(std::move(record));
           st->last_open = true;
         } else if (st->last_open && !st->records.empty()) {
           st->records.back().message += "\n" + line;

@@ -1,0 +1,39 @@
+#!/usr/bin/env bash
+# Makes sure the Debian packages a target needs are installed: installs them with apt-get when
+# run as root, and otherwise says exactly what to install.
+#   scripts/deps.sh base|fuzz|soak|arm64
+set -euo pipefail
+
+packages=(cmake ninja-build g++ libgtest-dev libgmock-dev libbenchmark-dev android-liblog-dev
+          iproute2 util-linux)
+case "${1:-base}" in
+  base) ;;
+  fuzz) packages+=(clang libclang-rt-dev) ;;
+  soak) packages+=(valgrind) ;;
+  arm64) packages+=(g++-aarch64-linux-gnu qemu-user blueprint-tools) ;;
+  *) echo "usage: $0 base|fuzz|soak|arm64" >&2; exit 2 ;;
+esac
+
+if ! command -v dpkg-query >/dev/null 2>&1; then
+  echo "kestreld builds on Debian: it needs the packages ${packages[*]}" >&2
+  exit 1
+fi
+
+missing=()
+for p in "${packages[@]}"; do
+  if ! dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed"; then
+    missing+=("$p")
+  fi
+done
+[ ${#missing[@]} -eq 0 ] && exit 0
+
+if [ "$(id -u)" -eq 0 ]; then
+  echo "Installing ${missing[*]}"
+  export DEBIAN_FRONTEND=noninteractive
+  apt-get update -qq
+  apt-get install -y -qq "${missing[@]}" >/dev/null
+else
+  echo "Missing Debian packages: ${missing[*]}" >&2
+  echo "Install them with:  sudo apt-get install ${missing[*]}" >&2
+  exit 1
+fi

@@ -1,0 +1,30 @@
+#!/usr/bin/env bash
+# Runs every test through CTest: the whole suite on the normal build and, with SANITIZE=1 (as in
+# CI), once more under AddressSanitizer with UndefinedBehaviorSanitizer and the concurrency tests
+# under ThreadSanitizer. CTest's summary line closes the output.
+set -euo pipefail
+cd "$(dirname "$0")/.."
+jobs=$(nproc)
+
+configure_and_build() {  # dir, extra cmake arguments...
+  local dir=$1; shift
+  cmake -S . -B "$dir" -G Ninja -DKESTREL_BUILD_BENCH=OFF "$@" >/dev/null
+  cmake --build "$dir" -- -j"$jobs" >/dev/null
+}
+
+status=0
+if [ "${SANITIZE:-0}" = 1 ]; then
+  echo "== AddressSanitizer + UndefinedBehaviorSanitizer: every test"
+  configure_and_build build-asan -DKESTREL_SANITIZE=address,undefined
+  ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1 \
+    ctest --test-dir build-asan -j"$jobs" --output-on-failure || status=1
+  echo "== ThreadSanitizer: the concurrency tests"
+  configure_and_build build-tsan -DKESTREL_SANITIZE=thread
+  TSAN_OPTIONS=halt_on_error=1 \
+    ctest --test-dir build-tsan -L concurrency -j"$jobs" --output-on-failure || status=1
+fi
+
+echo "== Every test"
+configure_and_build build
+ctest --test-dir build -j"$jobs" --output-on-failure || status=1
+exit $status
