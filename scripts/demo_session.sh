@@ -1,0 +1,91 @@
+#!/usr/bin/env bash
+# The demo's session, run inside its own network namespace by scripts/demo.sh.
+set -uo pipefail
+build=$1
+here=$(cd "$(dirname "$0")/.." && pwd)
+work=$(mktemp -d /tmp/kestrel-demo-XXXXXX)
+scale=${KESTREL_DEMO_TIME_SCALE:-0.25}
+
+bold=$(printf '\033[1m'); dim=$(printf '\033[2m'); off=$(printf '\033[0m')
+[ -t 1 ] || { bold=; dim=; off=; }
+say() { printf '\n%s== %s%s\n' "$bold" "$*" "$off"; }
+
+# The phone's shell tools, recorded instead of run: the demo must not change this machine.
+mkdir -p "$work/bin" "$work/root/data/misc/radio"
+for tool in chown chmod diag_mdlog; do
+  printf '#!/bin/sh\necho "%s $*" >> "%s/tools.log"\n' "$tool" "$work" > "$work/bin/$tool"
+  chmod +x "$work/bin/$tool"
+done
+printf 'AP' > "$work/root/data/misc/radio/uart.txt"
+printf 'persist.sys.usb.q_config=mtp,adb\nro.debug_level=0x494d\n' > "$work/props"
+
+export KESTREL_SENSOR1_SOCKET=$work/sensor1.sock
+export KESTREL_PROPERTIES=$work/props
+export KESTREL_SENSOR_REG=$here/tools/sim/sample_registry.txt
+export KESTREL_SYSROOT=$work/root
+export KESTREL_KERNEL_PORT=100
+export KESTREL_TIME_SCALE=$scale
+export PATH=$work/bin:$PATH
+
+sim=$build/tools/sim/kestrel-sim
+ctl=$build/tools/ctl/kestrelctl
+pids=()
+cleanup() { for p in "${pids[@]}"; do kill "$p" 2>/dev/null; done; wait 2>/dev/null; rm -rf "$work"; }
+trap cleanup EXIT
+
+say "kestrel-sim plays the sensor processor, kestreld starts (delays scaled by $scale)"
+"$sim" --socket "$KESTREL_SENSOR1_SOCKET" > "$work/sim.log" 2>&1 &
+pids+=($!)
+"$build/kestreld" 2> "$work/kestreld.log" &
+pids+=($!)
+
+wait_log() {  # text, seconds
+  local deadline=$((SECONDS + $2))
+  until grep -qF -- "$1" "$work/kestreld.log"; do
+    [ $SECONDS -ge $deadline ] && { echo "timed out waiting for: $1"; return 1; }
+    sleep 0.1
+  done
+}
+show_log() {  # pattern
+  grep -E -- "$1" "$work/kestreld.log" | sed -E 's/^KESTRELD ([VDIWEF]) [0-9-]+ [0-9:]+ +[0-9]+ +[0-9]+ /  \1 /'
+}
+
+wait_log "main: do while start = 0" 30
+show_log "Factory Daemon Start|open_and_bind_socket|main: do while start = 0"
+
+say "3 s after boot the DIAG start thread opens the sensor service and starts logging"
+wait_log "sns_set_diag_tx_mode: diag_mdlog Enter" 30 && show_log "diag_logging_start_thread|sensor1_open|check_|diag_mdlog Enter"
+[ -f "$work/tools.log" ] && sed 's/^/  ran: /' "$work/tools.log"
+
+passed=0; failed=0
+run() {  # title, kestrelctl arguments...
+  local title=$1; shift
+  say "$title:  kestrelctl $*"
+  if "$ctl" "$@"; then passed=$((passed + 1)); else failed=$((failed + 1)); echo "  ${bold}FAILED${off}"; fi
+}
+
+run "Sensor status" status accel
+run "Accelerometer self test" selftest accel
+run "Gyroscope self test" selftest gyro
+run "Magnetometer self test" selftest mag
+run "Pressure sensor self test" selftest pressure
+run "Gyroscope temperature" gyro-temp
+run "Magnetometer fuse ROM" mag fuserom
+run "Magnetometer registers" mag registers
+run "Accelerometer stream, two seconds" stream accel --seconds 2
+run "Register dump of the accelerometer" dump 0
+run "Calibration from the registry" calib read accel
+run "Calibration store" calib store accel --flag 0
+run "Coefficient file permissions" hh-perms
+
+say "A DIAG dump (command 27, argument 0) restarts logging"
+: > "$work/tools.log"
+# The dump stops the tool, waits 2 s, starts it again and waits 5 s more.
+"$ctl" diag dump >/dev/null && sleep "$(awk "BEGIN { print $scale * 9 }")"
+show_log "diag : |diag_logging_thread|STATE:" | tail -n 12
+sed 's/^/  ran: /' "$work/tools.log" 2>/dev/null
+
+say "Summary"
+echo "  $passed passed, $failed failed"
+echo "  ${dim}full daemon log: $(grep -c '^KESTRELD' "$work/kestreld.log") records${off}"
+[ "$failed" -eq 0 ]
