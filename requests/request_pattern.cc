@@ -1,9 +1,12 @@
 #include "request_pattern.h"
 
+#include <stddef.h>
 #include <stdlib.h>
 #include <string.h>
 
+#include "byte_order.h"
 #include "kestrel_log.h"
+#include "sensor1_messages.h"
 #include "service_link/connection.h"
 #include "service_link/response_waiter.h"
 
@@ -65,4 +68,48 @@ int32_t wait_for_answer(const char* name) {
   const int32_t r = wait_for_response();
   if (r == 0) KLOGE("%s: ERROR: No response for command", name);
   return r;
+}
+
+void abandon_request(sensor1_request* req) {
+  sensor1_free_msg_buf(req->handle, req->body);
+  req->body = nullptr;
+}
+
+void write_test_request(void* body, int32_t sensor_id, uint8_t option0, uint8_t option1,
+                        uint8_t option2, uint8_t option3) {
+  store_u8(body, offsetof(single_sensor_test_request, sensor_id), static_cast<uint8_t>(sensor_id));
+  store_u8(body, offsetof(single_sensor_test_request, data_type), 0);
+  const size_t options = offsetof(single_sensor_test_request, option);
+  store_u8(body, options + 0, option0);
+  store_u8(body, options + 1, option1);
+  store_u8(body, options + 2, option2);
+  store_u8(body, options + 3, option3);
+}
+
+void write_test_type(void* body, uint32_t test_type) {
+  store_u32(body, offsetof(single_sensor_test_request, test_type), test_type);
+}
+
+uint8_t test_request_sensor_id(const void* body) {
+  return load_u8(body, offsetof(single_sensor_test_request, sensor_id));
+}
+
+void write_daf_request_id(void* body, uint32_t daf_request_id) {
+  store_u32(body, offsetof(daf_request, daf_request_id), daf_request_id);
+  store_u8(body, offsetof(daf_request, flag), 1);
+  store_u8(body, offsetof(daf_request, trailing_flag), 0);
+}
+
+uint8_t* daf_suid_field(void* body) {
+  return static_cast<uint8_t*>(body) + offsetof(daf_request, suid);
+}
+
+void write_daf_suid(void* body, const uint8_t* suid) {
+  memcpy(daf_suid_field(body), suid, sizeof(daf_request::suid));
+}
+
+void write_daf_data(void* body, const void* data, uint32_t length) {
+  if (length > kDafDataMax) length = kDafDataMax;
+  store_u32(body, offsetof(daf_request, data_length), length);
+  memcpy(static_cast<uint8_t*>(body) + offsetof(daf_request, data), data, length);
 }

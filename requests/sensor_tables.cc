@@ -6,7 +6,7 @@
 
 namespace {
 
-constexpr int32_t kSmgrIdBySensorType[16] = {0, 10, 20, 30, 40, 40, 60, -1,
+constexpr int32_t kSmgrIdBySensorType[16] = {0,  10, 20, 30, 40, 40, 60, -1,
                                              20, 20, -1, 10, 0,  0,  0,  0};
 
 }  // namespace

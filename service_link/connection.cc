@@ -58,6 +58,8 @@ sensor1_handle_s* get_handle_for_sensor(int32_t sensor_type) {
 
 sensor1_handle_s* current_sensor1_handle() { return sensor1_handle.load(); }
 
+intptr_t sensor1_callback_data() { return reinterpret_cast<intptr_t>(&sensor1_handle); }
+
 int close_sensor1_handle() {
   pthread_mutex_lock(&g_open_lock);
   sensor1_handle_s* handle = sensor1_handle.exchange(nullptr);

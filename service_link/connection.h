@@ -15,6 +15,10 @@ sensor1_handle_s* get_handle_for_sensor(int32_t sensor_type);
 // The current handle (null when empty), without opening anything.
 sensor1_handle_s* current_sensor1_handle();
 
+// The callback data registered with the connection (the address of the handle variable), for
+// tests that call rcv_test_msg as the library does.
+intptr_t sensor1_callback_data();
+
 // Closes the current handle (if any) and empties it; used by the broken-pipe recovery and by the
 // closing variant of the request pattern. Returns the close result (0 when there was none).
 int close_sensor1_handle();

@@ -1,9 +1,113 @@
-// Placeholder until the conversions land.
 #include "sample_conversion.h"
 
-void convert_sample(uint8_t, uint8_t, int32_t, int32_t, int32_t, const mag_sensitivity_values&,
-                    sample_frame* frame) {
-  *frame = sample_frame{};
+#include <cmath>
+
+namespace {
+
+// 1/65536: the sensor manager's Q16 fixed point.
+constexpr double kQ16 = 1.52587890625e-5;
+// Accelerometer counts to the kernel's unit, applied in single precision.
+constexpr float kAccelScale = 417.67575f;
+// Gyroscope and magnetometer scales, in double precision.
+constexpr double kGyroScale = 0.06119849462134102;
+constexpr double kMagScale = 0.01017252595324357;
+
+// Kernel sensor codes of the sample frame.
+constexpr int32_t kCodeAccel = 0;
+constexpr int32_t kCodeGyro = 1;
+constexpr int32_t kCodeMag = 2;
+constexpr int32_t kCodePressure = 3;
+constexpr int32_t kCodeSecondary = 4;
+constexpr int32_t kCodeLight = 5;
+constexpr int32_t kCode60 = 6;
+constexpr int32_t kCodeUnknown = -1;
+
+// A(n): the product is taken in single precision and only then widened.
+double accel(int32_t n) {
+  return static_cast<double>(static_cast<float>(n) * kAccelScale);
 }
 
-int16_t to_frame_value(double) { return 0; }
+// M(n): n goes through single precision, the product is taken in double.
+double mag(int32_t n) {
+  return static_cast<double>(static_cast<float>(n)) * kMagScale;
+}
+
+double q16(int32_t n) {
+  return static_cast<double>(n) * kQ16;
+}
+
+int16_t low_half(int32_t n) {
+  return static_cast<int16_t>(static_cast<uint16_t>(n & 0xffff));
+}
+
+}  // namespace
+
+int16_t to_frame_value(double v) {
+  int32_t i;
+  if (std::isnan(v)) {
+    i = 0;
+  } else if (v >= 2147483648.0) {
+    i = INT32_MAX;
+  } else if (v <= -2147483649.0) {
+    i = INT32_MIN;
+  } else {
+    i = static_cast<int32_t>(v);  // truncates toward zero, in range by the tests above
+  }
+  return low_half(i);
+}
+
+void convert_sample(uint8_t sensor_id, uint8_t data_type, int32_t x, int32_t y, int32_t z,
+                    const mag_sensitivity_values& sensitivity, sample_frame* frame) {
+  *frame = sample_frame{};
+  int16_t* v = frame->value;
+  if (data_type == 1) {
+    frame->code = kCodeSecondary;
+    v[0] = to_frame_value(q16(x));
+    v[1] = to_frame_value(q16(y));
+    v[2] = to_frame_value(q16(z));
+    return;
+  }
+  // The accelerometer, gyroscope and magnetometer are mounted with x and y swapped and z
+  // reversed against the kernel's axes.
+  switch (sensor_id) {
+    case 0:
+      frame->code = kCodeAccel;
+      v[0] = to_frame_value(accel(y) * kQ16);
+      v[1] = to_frame_value(accel(x) * kQ16);
+      v[2] = to_frame_value(-(accel(z) * kQ16));
+      break;
+    case 10:
+      frame->code = kCodeGyro;
+      v[0] = to_frame_value(static_cast<double>(y) * kGyroScale);
+      v[1] = to_frame_value(static_cast<double>(x) * kGyroScale);
+      v[2] = to_frame_value(-(static_cast<double>(z) * kGyroScale));
+      break;
+    case 20:
+      // Each axis by its own sensitivity; a sensitivity still 0 gives an infinite quotient,
+      // which saturates (or 0/0, which gives 0).
+      frame->code = kCodeMag;
+      v[0] = to_frame_value(mag(y) / static_cast<double>(sensitivity.y));
+      v[1] = to_frame_value(mag(x) / static_cast<double>(sensitivity.x));
+      v[2] = to_frame_value(-mag(z) / static_cast<double>(sensitivity.z));
+      break;
+    case 30:
+      frame->code = kCodePressure;
+      break;
+    case 40:
+      frame->code = kCodeLight;
+      v[0] = to_frame_value(1.0 + static_cast<double>(x) * -kQ16);
+      break;
+    case 60:
+      frame->code = kCode60;
+      v[0] = to_frame_value(q16(x));
+      v[1] = to_frame_value(q16(y));
+      v[2] = to_frame_value(q16(z));
+      v[3] = low_half(x);
+      v[4] = low_half(y);
+      v[5] = low_half(z);
+      break;
+    default:
+      frame->code = kCodeUnknown;
+      break;
+  }
+}

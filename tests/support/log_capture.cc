@@ -2,6 +2,7 @@
 
 #include <android/log.h>
 
+#include <atomic>
 #include <condition_variable>
 #include <mutex>
 
@@ -10,7 +11,7 @@ namespace {
 std::mutex g_mutex;
 std::condition_variable g_cond;
 std::vector<LogRecord>* g_records = nullptr;
-bool g_echo = false;
+std::atomic<bool> g_echo{false};
 
 void capture_logger(const struct __android_logger_data* data, const char* message) {
   {
@@ -25,11 +26,15 @@ void capture_logger(const struct __android_logger_data* data, const char* messag
 
 }  // namespace
 
+// liblog calls the logger under a lock of its own, and the logger takes g_mutex: so liblog is
+// never called with g_mutex held.
 LogCapture::LogCapture() {
-  std::lock_guard<std::mutex> lock(g_mutex);
-  g_records = new std::vector<LogRecord>();
-  const char* echo = getenv("KESTREL_TEST_ECHO_LOG");
-  g_echo = echo != nullptr && echo[0] == '1';
+  {
+    std::lock_guard<std::mutex> lock(g_mutex);
+    g_records = new std::vector<LogRecord>();
+    const char* echo = getenv("KESTREL_TEST_ECHO_LOG");
+    g_echo = echo != nullptr && echo[0] == '1';
+  }
   __android_log_set_logger(capture_logger);
 }
 

@@ -67,7 +67,9 @@ class Simulator {
   void stop_listening();
   void resume_listening();
 
-  // Number of connections that completed the OPEN handshake with result 0, over the life.
+  // Number of connections that completed the OPEN handshake with result 0, over the life. A
+  // connection is counted, and is the current one, before its OPEN_RESULT goes out: once
+  // sensor1_open has returned 0, records sent here reach that connection.
   int opened_connections() const;
   // True once a connection is open (the current one), within timeout.
   bool wait_for_connection(Millis timeout);
@@ -91,10 +93,28 @@ class Simulator {
   // Closes the current connection from the simulator's side: the library sees end of file.
   void drop_connection();
 
+  // False when the socket could not be bound (the reason went to stderr) or after
+  // stop_listening().
+  bool listening() const;
+  // Number of the current connection, 0 when none is open.
+  int current_connection() const;
+  // Records to one connection by its number (Request::connection), whether or not it is the
+  // current one. False when that connection has ended or the record could not be sent.
+  bool respond_to(int connection, Header header, const std::vector<uint8_t>& body);
+  bool indicate_to(int connection, Header header, const std::vector<uint8_t>& body);
+
   // Hook run for every WRITE before the healthy phone (if on) answers it; tests use it to answer
   // a request at the moment it arrives. Runs on the simulator's connection thread.
+  // fault() must not be called from it (it would wait for an acknowledgement that only this
+  // thread can read): there it returns false and sends nothing.
   using RequestHook = std::function<void(Simulator&, const Request&)>;
   void set_request_hook(RequestHook hook);
+
+  // Hook run when a connection completes its OPEN handshake (opened true) and when an opened
+  // connection ends (opened false), on the simulator's connection thread. Connections still open
+  // when the simulator is destroyed end without it.
+  using ConnectionHook = std::function<void(Simulator&, int connection, bool opened)>;
+  void set_connection_hook(ConnectionHook hook);
 
  private:
   struct State;
