@@ -72,11 +72,26 @@ run "Pressure sensor self test" selftest pressure
 run "Gyroscope temperature" gyro-temp
 run "Magnetometer fuse ROM" mag fuserom
 run "Magnetometer registers" mag registers
-run "Accelerometer stream, two seconds" stream accel --seconds 2
+# A stream prints every sample; the demo shows its start, its end and how many came.
+say "Accelerometer stream, two seconds at 100 Hz:  kestrelctl stream accel --seconds 2"
+if "$ctl" --quiet stream accel --seconds 2 > "$work/stream.txt"; then
+  passed=$((passed + 1))
+  samples=$(grep -c "^type 2 " "$work/stream.txt")
+  grep -v "^type 2 " "$work/stream.txt" | head -n 1
+  grep "^type 2 " "$work/stream.txt" | head -n 3
+  echo "  ${dim}... $samples samples in all ...${off}"
+  grep "^type 2 " "$work/stream.txt" | tail -n 2
+  grep -v "^type 2 " "$work/stream.txt" | tail -n +2
+else
+  failed=$((failed + 1)); echo "  ${bold}FAILED${off}"
+fi
 run "Register dump of the accelerometer" dump 0
 run "Calibration from the registry" calib read accel
 run "Calibration store" calib store accel --flag 0
+
+: > "$work/tools.log"
 run "Coefficient file permissions" hh-perms
+wait_log "chown : end" 10 && sed 's/^/  ran: /' "$work/tools.log"
 
 say "A DIAG dump (command 27, argument 0) restarts logging"
 : > "$work/tools.log"
