@@ -6,25 +6,36 @@ set -euo pipefail
 cd "$(dirname "$0")/.."
 jobs=$(nproc)
 
-configure_and_build() {  # dir, extra cmake arguments...
+configure() {  # dir, extra cmake arguments...
   local dir=$1; shift
   cmake -S . -B "$dir" -G Ninja -DKESTREL_BUILD_BENCH=OFF "$@" >/dev/null
-  cmake --build "$dir" -- -j"$jobs" >/dev/null
+}
+build() {  # dir, targets...
+  local dir=$1; shift
+  if ! cmake --build "$dir" -- -j"$jobs" "$@" > "$dir/build.log" 2>&1; then
+    tail -n 60 "$dir/build.log"
+    return 1
+  fi
 }
 
 status=0
 if [ "${SANITIZE:-0}" = 1 ]; then
   echo "== AddressSanitizer + UndefinedBehaviorSanitizer: every test"
-  configure_and_build build-asan -DKESTREL_SANITIZE=address,undefined
+  configure build-asan -DKESTREL_SANITIZE=address,undefined
+  build build-asan
   ASAN_OPTIONS=detect_leaks=1:abort_on_error=1 UBSAN_OPTIONS=print_stacktrace=1 \
     ctest --test-dir build-asan -j"$jobs" --output-on-failure || status=1
   echo "== ThreadSanitizer: the concurrency tests"
-  configure_and_build build-tsan -DKESTREL_SANITIZE=thread
+  configure build-tsan -DKESTREL_SANITIZE=thread
+  # Only the concurrency tests and the programs they run.
+  race_tests=$(ninja -C build-tsan -t targets all | grep -oE '^[a-z0-9_]+_race_test' | sort -u)
+  build build-tsan kestreld kestrel-sim kestrelctl $race_tests
   TSAN_OPTIONS=halt_on_error=1 \
     ctest --test-dir build-tsan -L concurrency -j"$jobs" --output-on-failure || status=1
 fi
 
 echo "== Every test"
-configure_and_build build
+configure build
+build build
 ctest --test-dir build -j"$jobs" --output-on-failure || status=1
 exit $status
