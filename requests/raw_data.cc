@@ -97,10 +97,24 @@ void fill_light_request(void* body, uint32_t daf_request_id, uint32_t data) {
   write_daf_data(body, bytes, sizeof bytes);
 }
 
-// Writes a light-sensor request; a failed write is logged and the operation carries on.
-void write_light_request(sensor1_request* req, int32_t sensor_type) {
+// Starts or stops the light sensor's polling run through the driver access service. A failed
+// write is logged and the operation carries on; false when no body could be had.
+bool send_light_request(sensor1_request* req, const char* name, int32_t sensor_type,
+                        uint32_t daf_request_id, uint32_t data) {
+  if (!begin_request(req, name, sensor_type, kServiceDaf, kMsgDafRequest, sizeof(daf_request),
+                     kTxnDaf, alloc_failure_text::kGetRaw)) {
+    return false;
+  }
+  KLOGI("%s sensor_type:%d\n", name, sensor_type);
+  fill_light_request(req->body, daf_request_id, data);
   const int r = write_request(req);
-  if (r != 0) KLOGE("[DAF][%s]sensor1_write -error  %d %d\n", req->name, r, sensor_type);
+  if (r != 0) KLOGE("[DAF][%s]sensor1_write -error  %d %d\n", name, r, sensor_type);
+  return true;
+}
+
+bool begin_report_request(sensor1_request* req, const char* name, int32_t sensor_type) {
+  return begin_request(req, name, sensor_type, kServiceSmgr, kMsgSmgrReport, kReportRequestSize,
+                       kTxnReport, alloc_failure_text::kBracketed);
 }
 
 }  // namespace
@@ -111,19 +125,10 @@ int get_raw_data(const uint8_t* frame) {
   const int32_t smgr_id = smgr_id_by_sensor_type(sensor_type);
   sensor1_request req;
   if (is_light_sensor_type(sensor_type)) {
-    if (!begin_request(&req, name, sensor_type, kServiceDaf, kMsgDafRequest, sizeof(daf_request),
-                       kTxnDaf, alloc_failure_text::kGetRaw)) {
-      return -1;
-    }
-    KLOGI("%s sensor_type:%d\n", name, sensor_type);
-    fill_light_request(req.body, sensor_type == 4 ? kDafLightStreamStart : kDafLightShortStart,
-                       kLightStreamData);
-    write_light_request(&req, sensor_type);
+    const uint32_t id = sensor_type == 4 ? kDafLightStreamStart : kDafLightShortStart;
+    if (!send_light_request(&req, name, sensor_type, id, kLightStreamData)) return -1;
   } else {
-    if (!begin_request(&req, name, sensor_type, kServiceSmgr, kMsgSmgrReport, kReportRequestSize,
-                       kTxnReport, alloc_failure_text::kBracketed)) {
-      return -1;
-    }
+    if (!begin_report_request(&req, name, sensor_type)) return -1;
     // The calibration reset goes out while the report body is already allocated; the
     // sensitivities are in place before the report starts, so its first samples see them.
     if (sensor_type == kMagSensorType) prepare_mag_stream();
@@ -141,19 +146,10 @@ int stop_raw_data(const uint8_t* frame) {
   const int32_t smgr_id = smgr_id_by_sensor_type(sensor_type);
   sensor1_request req;
   if (is_light_sensor_type(sensor_type)) {
-    if (!begin_request(&req, name, sensor_type, kServiceDaf, kMsgDafRequest, sizeof(daf_request),
-                       kTxnDaf, alloc_failure_text::kGetRaw)) {
-      return -1;
-    }
-    KLOGI("%s sensor_type:%d\n", name, sensor_type);
-    fill_light_request(req.body, sensor_type == 4 ? kDafLightStreamStop : kDafLightShortStop,
-                       kLightStopData);
-    write_light_request(&req, sensor_type);
+    const uint32_t id = sensor_type == 4 ? kDafLightStreamStop : kDafLightShortStop;
+    if (!send_light_request(&req, name, sensor_type, id, kLightStopData)) return -1;
   } else {
-    if (!begin_request(&req, name, sensor_type, kServiceSmgr, kMsgSmgrReport, kReportRequestSize,
-                       kTxnReport, alloc_failure_text::kBracketed)) {
-      return -1;
-    }
+    if (!begin_report_request(&req, name, sensor_type)) return -1;
     fill_report_delete(req.body, smgr_id);
     const int r = write_request(&req);
     if (r != 0) KLOGE("[%s]sensor1_write -error  %d %d\n", name, r, sensor_type);
