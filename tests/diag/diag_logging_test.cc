@@ -1,90 +1,16 @@
 // DIAG logging control inside one process: whether logging may start, the start thread, and
 // command 27 with the dump thread it starts.
-#include <stdlib.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <optional>
 #include <thread>
+#include <tuple>
 
-#include "daemon_fixture.h"
-#include "diag/diag_logging.h"
+#include "diag_fixture.h"
 #include "service_link/connection.h"
 
 namespace {
-
-using Lines = std::vector<std::string>;
-
-const char kStart[] = "diag_mdlog -f /system/etc/Diag_Sensor.cfg -p 16 -o /data/log -n 3 -s 1 -c";
-const char kStop[] = "diag_mdlog -k -p 16";
-
-Lines operator+(Lines a, const Lines& b) {
-  a.insert(a.end(), b.begin(), b.end());
-  return a;
-}
-
-// "<priority letter> <message>" of the daemon's lines that start with one of prefixes, and of
-// every libdiag call ("I libdiag: ...") unless left out, in the order they were logged.
-Lines view(const LogCapture& log, const std::vector<std::string>& prefixes,
-           bool with_libdiag = true) {
-  Lines out;
-  for (const LogRecord& r : log.records()) {
-    const std::string p(1, "??VDIWEF"[r.priority & 7]);
-    if (r.tag == "libdiag" && with_libdiag) out.push_back(p + " libdiag: " + r.message);
-    if (r.tag != "KESTRELD") continue;
-    for (const std::string& prefix : prefixes) {
-      if (r.message.compare(0, prefix.size(), prefix) == 0) {
-        out.push_back(p + " " + r.message);
-        break;
-      }
-    }
-  }
-  return out;
-}
-
-Lines diag_lines(const LogCapture& log) {
-  return view(log, {"diag_logging", "check_", "sns_set_diag", "send_dumpstate"});
-}
-
-Lines mode_lines(int mode) {
-  return {"I libdiag: Diag_LSM_Init ok",
-          "E sns_set_diag_mode: diag_configure_peripheral_buffering_tx_mode Enter\n",
-          "I libdiag: diag_configure_peripheral_buffering_tx_mode 3 " + std::to_string(mode) +
-              " 1 90 -> 1",
-          "I libdiag: Diag_LSM_DeInit"};
-}
-
-const Lines kChecksPass = {"I check_property Success\n", "I check_files is not exist -1\n"};
-const Lines kStarted = mode_lines(2) + Lines{"I sns_set_diag_tx_mode: diag_mdlog Enter 1\n"};
-const Lines kDmMode = {"I sns_set_diag_tx_mode: DM mode is setting\n"};
-
-std::string uart_path() {
-  return test_sysroot() + "/data/misc/radio/uart.txt";
-}
-
-void use_tools(const FakeTools& tools) {
-  static const std::string path = getenv("PATH");
-  setenv("PATH", (tools.dir() + ":" + path).c_str(), 1);
-}
-
-class DiagTest : public DaemonFixture {
- protected:
-  void SetUp() override {
-    DaemonFixture::SetUp();
-    use_tools(tools);
-    write_file(test_properties_path(), "");
-    remove_file(uart_path());
-  }
-
-  // The dump thread sets the state last, right before it ends.
-  static bool wait_for_state(int32_t value) {
-    for (int i = 0; i < 4000 && diag_logging_state() != value; ++i) {
-      std::this_thread::sleep_for(5ms);
-    }
-    return diag_logging_state() == value;
-  }
-
-  FakeTools tools;
-};
 
 TEST_F(DiagTest, UsbConfigAndUartFileDecideWhetherLoggingStarts) {
   struct Case {
@@ -92,13 +18,16 @@ TEST_F(DiagTest, UsbConfigAndUartFileDecideWhetherLoggingStarts) {
     const char* uart;  // null: no file; "/": a directory in its place
     Lines expected;
   };
+  const Lines diag_mode = {"I check_property is Diag Mode\n",
+                           "I sns_set_diag_tx_mode: DM mode is setting\n"};
+  const Lines dm = {"I sns_set_diag_tx_mode: DM mode is setting\n"};
   const Case cases[] = {
       // DIAG in the USB configuration: the UART file is not even looked at.
-      {"diag", "AP", Lines{"I check_property is Diag Mode\n"} + kDmMode},
-      {"mtp,diag,adb", "AP", Lines{"I check_property is Diag Mode\n"} + kDmMode},
+      {"diag", "AP", diag_mode},
+      {"mtp,diag,adb", "AP", diag_mode},
       {"mtp,adb", "CP\n",
-       Lines{"I check_property Success\n", "I check_files is Diag Mode CP\n"} + kDmMode},
-      {"mtp,adb", "/", Lines{"I check_property Success\n", "E check_files read fails"} + kDmMode},
+       Lines{"I check_property Success\n", "I check_files is Diag Mode CP\n"} + dm},
+      {"mtp,adb", "/", Lines{"I check_property Success\n", "E check_files read fails"} + dm},
       // Only the first two bytes count.
       {"", "APCP", Lines{"I check_property Success\n", "I check_files is AP Mode AP\n"} + kStarted},
       {"", "", Lines{"I check_property Success\n", "I check_files is AP Mode \n"} + kStarted},
@@ -121,12 +50,10 @@ TEST_F(DiagTest, UsbConfigAndUartFileDecideWhetherLoggingStarts) {
 
     sns_set_diag_tx_mode();
 
-    EXPECT_EQ(diag_lines(*log), c.expected);
+    EXPECT_EQ(view(log->records()), c.expected);
     const bool started = c.expected.back() == kStarted.back();
     EXPECT_EQ(diag_logging_state(), started ? 1 : 0);
-    if (started) {
-      EXPECT_TRUE(case_tools.wait_for_calls(1, 5000));
-    }
+    EXPECT_TRUE(!started || case_tools.wait_for_calls(1, 5000));
     EXPECT_EQ(case_tools.calls(), started ? Lines{kStart} : Lines{});
   }
   rmdir(uart_path().c_str());
@@ -137,7 +64,7 @@ TEST_F(DiagTest, DebugLevelEndsStartThreadBeforeTheServiceIsOpened) {
   set_diag_logging_state(1);
   std::thread(diag_logging_start_thread, nullptr).join();
 
-  EXPECT_EQ(diag_lines(*log),
+  EXPECT_EQ(view(log->records()),
             (Lines{"I diag_logging_start_thread start\n", "I check_loglevel stop logging\n"}));
   EXPECT_EQ(diag_logging_state(), 0);
   EXPECT_EQ(open_retry_budget(), kOpenRetryBudget);
@@ -150,10 +77,11 @@ TEST_F(DiagTest, StartThreadOpensTheServiceThenStartsLogging) {
   std::thread(diag_logging_start_thread, nullptr).join();
 
   EXPECT_EQ(sim->opened_connections(), 1);
-  EXPECT_EQ(view(*log, {"sensor1_open_or_reopen", "diag_logging", "check_", "sns_set_diag"}),
-            (Lines{"I diag_logging_start_thread start\n",
-                   "I sensor1_open_or_reopen: sensor1_open success\n"} +
-             kChecksPass + kStarted));
+  EXPECT_EQ(
+      view(log->records(), {"sensor1_open_or_reopen", "diag_logging", "check_", "sns_set_diag"}),
+      (Lines{"I diag_logging_start_thread start\n",
+             "I sensor1_open_or_reopen: sensor1_open success\n"} +
+       kChecksPass + kStarted));
   EXPECT_EQ(diag_logging_state(), 1);
   ASSERT_TRUE(tools.wait_for_calls(1, 5000));
   EXPECT_EQ(tools.calls(), Lines{kStart});
@@ -165,7 +93,7 @@ TEST_F(DiagTest, DumpStopsAndRestartsLogging) {
 
   // The dispatcher's own lines; the dump thread's are checked below.
   EXPECT_EQ(
-      view(*log, {"diag :", "process_message: 27", "process_message: logging"}, false),
+      view(log->records(), {"diag :", "process_message: 27", "process_message: logging"}, false),
       (Lines{"I process_message: 27", "I diag : debugging_mode 1\n",
              "I diag : To start logging 3\n", "I process_message: logging_thread_handle success \n",
              "E diag : To stop logging 3\n"}));
@@ -177,46 +105,26 @@ TEST_F(DiagTest, DumpStopsAndRestartsLogging) {
   EXPECT_EQ(at_checks[0], kStop);
 
   ASSERT_TRUE(wait_for_state(1));
-  EXPECT_EQ(diag_lines(*log),
+  EXPECT_EQ(view(log->records()),
             Lines{"I diag_logging_thread start\n"} + mode_lines(0) + kChecksPass + kStarted);
   ASSERT_TRUE(tools.wait_for_calls(2, 5000));
   EXPECT_EQ(tools.calls(), (Lines{kStop, kStart}));
 }
 
-TEST_F(DiagTest, OtherCommand27CasesOnlyLogStopAndAskForSensorStates) {
-  struct Case {
-    int32_t state;
-    int32_t argument;
-    Lines expected;
-    int32_t state_after;
-    Lines calls;
-  };
-  const Case cases[] = {
-      {3,
-       0,
-       {"I process_message: 27", "I diag : debugging_mode 3\n",
-        "I diag : Logging System is running\n"},
-       3,
-       {}},
-      {0, 0, {"I process_message: 27", "I diag : Diabled Logging System\n"}, 0, {}},
-      {1, 2, {"I process_message: 27"}, 1, {}},
-      {3, 1, {"I process_message: 27"}, 0, {kStop}},
-  };
-  for (const Case& c : cases) {
-    SCOPED_TRACE("state " + std::to_string(c.state) + ", argument " + std::to_string(c.argument));
-    FakeTools case_tools;
-    use_tools(case_tools);
-    set_diag_logging_state(c.state);
+TEST_F(DiagTest, Command27WhileLoggingRunsOrWithArgument2OnlyLogsAndAsksForSensorStates) {
+  for (const auto& [state, argument, expected] :
+       {std::tuple{3, 0,
+                   Lines{"I process_message: 27", "I diag : debugging_mode 3\n",
+                         "I diag : Logging System is running\n"}},
+        std::tuple{1, 2, Lines{"I process_message: 27"}}}) {
+    set_diag_logging_state(state);
     log->clear();
-
-    command(27, {0, c.argument});
-
-    EXPECT_EQ(view(*log, {"diag", "process_message: 27", "process_message: logging", "check_",
-                          "sns_set_diag"}),
-              c.expected);
-    EXPECT_EQ(diag_logging_state(), c.state_after);
-    // A stop command has run to its end by the time the command returns.
-    EXPECT_EQ(case_tools.calls(), c.calls);
+    command(27, {0, argument});
+    EXPECT_EQ(view(log->records(), {"diag", "process_message: 27", "process_message: logging",
+                                    "check_", "sns_set_diag"}),
+              expected);
+    EXPECT_EQ(diag_logging_state(), state);
+    EXPECT_TRUE(tools.calls().empty());
     const std::optional<kestrel_sim::Request> request = sim->next_request(2000ms);
     ASSERT_TRUE(request.has_value());
     EXPECT_EQ(request->header.service, 0u);

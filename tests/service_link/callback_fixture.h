@@ -1,0 +1,53 @@
+// The service callback reached as the library reaches it, from any of the test's threads, with
+// the daemon's records and frames at hand and the recording shell tools first on PATH.
+#pragma once
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <stdlib.h>
+#include <string.h>
+
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "daemon_fixture.h"
+#include "sensor1_host.h"
+#include "service_link/connection.h"
+#include "service_link/service_callback.h"
+
+using Bytes = std::vector<uint8_t>;
+using Logged = std::pair<int, std::string>;  // priority, message
+
+class CallbackTest : public DaemonFixture {
+ protected:
+  void SetUp() override {
+    DaemonFixture::SetUp();
+    static const std::string path = getenv("PATH");
+    setenv("PATH", (tools.dir() + ":" + path).c_str(), 1);
+    write_file(test_properties_path(), "");
+  }
+  // A body from the library's allocator whose size is the header's msg_size; empty means null.
+  static void deliver(int type, uint32_t service, int32_t msg_id, uint8_t txn, const Bytes& body) {
+    sensor1_msg_header_s hdr = {service, msg_id, static_cast<uint16_t>(body.size()), txn};
+    void* msg = body.empty() ? nullptr : sensor1_host_alloc_body(body.size());
+    if (msg != nullptr) memcpy(msg, body.data(), body.size());
+    rcv_test_msg(sensor1_callback_data(), &hdr, type, msg);
+  }
+  // The daemon's records since the last clear, which this clears.
+  std::vector<Logged> logged() const {
+    std::vector<Logged> out;
+    for (const LogRecord& r : log->records()) {
+      if (r.tag == "KESTRELD") out.emplace_back(r.priority, r.message);
+    }
+    log->clear();
+    return out;
+  }
+  Bytes payload(uint16_t type) {
+    auto f = kernel->receive_type(type, 5000ms);
+    EXPECT_TRUE(f) << "no frame of type " << type;
+    return f ? f->payload : Bytes{};
+  }
+
+  FakeTools tools;
+};
