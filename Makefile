@@ -2,7 +2,7 @@
 # missing through apt-get when run as root, and say what to install otherwise.
 BUILD ?= build
 
-.PHONY: all build deps test demo clean
+.PHONY: all build deps test demo fuzz clean arm64-test bench soak
 
 all: build
 
@@ -18,6 +18,32 @@ test: deps
 
 demo: build
 	@scripts/demo.sh $(BUILD)
+
+# The libFuzzer targets, built with clang in build-fuzz and run one after another for FUZZ_SECONDS
+# each (default 60); fails on any crash, leak or sanitizer report.
+fuzz:
+	@scripts/deps.sh fuzz
+	@FUZZ_SECONDS=$(or $(FUZZ_SECONDS),60) fuzz/run_fuzzers.sh build-fuzz
+
+# The arm64 build with its tests under qemu-user, Android.bp through bpfmt, and the device side
+# compiled for arm64 (scripts/arm64_test.sh; docs/device.md).
+arm64-test:
+	@scripts/deps.sh arm64
+	@scripts/arm64_test.sh
+
+# The benchmarks, built in Release in build-bench and run against their limits; rewrites
+# docs/performance.md with the figures (scripts/bench.sh).
+bench: deps
+	@scripts/bench.sh
+
+# The long run: one million sample indications and one hundred thousand commands against the
+# healthy phone, then a shorter run under valgrind memcheck (scripts/soak.sh; figures in
+# docs/reliability.md).
+soak:
+	@scripts/deps.sh soak
+	@cmake -S . -B $(BUILD) -G Ninja >/dev/null
+	@cmake --build $(BUILD) --target kestrel-soak
+	@scripts/soak.sh $(BUILD)
 
 clean:
 	rm -rf build build-*

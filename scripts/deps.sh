@@ -10,7 +10,23 @@ case "${1:-base}" in
   base) ;;
   fuzz) packages+=(clang libclang-rt-dev) ;;
   soak) packages+=(valgrind) ;;
-  arm64) packages+=(g++-aarch64-linux-gnu qemu-user blueprint-tools) ;;
+  arm64)
+    # The cross compiler, qemu-user to run what it builds, bpfmt for Android.bp, and liblog and
+    # GoogleTest for arm64 from Debian's multiarch, which needs arm64 as a foreign architecture
+    # (added here as root; the install below then updates the package lists).
+    packages+=(g++-aarch64-linux-gnu qemu-user blueprint-tools android-liblog-dev:arm64
+               libgtest-dev:arm64 libgmock-dev:arm64)
+    if command -v dpkg >/dev/null 2>&1 &&
+        ! dpkg --print-foreign-architectures | grep -qx arm64; then
+      if [ "$(id -u)" -eq 0 ]; then
+        echo "Adding arm64 as a foreign architecture"
+        dpkg --add-architecture arm64
+      else
+        echo "Enable arm64 packages first:" \
+             "sudo dpkg --add-architecture arm64 && sudo apt-get update" >&2
+      fi
+    fi
+    ;;
   *) echo "usage: $0 base|fuzz|soak|arm64" >&2; exit 2 ;;
 esac
 

@@ -8,7 +8,14 @@
 #include "host_env.h"
 #include "kestrel_platform.h"
 
-int platform_netlink_protocol(void) { return NETLINK_USERSOCK; }
+// A build run under qemu-user sets KESTREL_HOST_NETLINK_PROTOCOL to NETLINK_KOBJECT_UEVENT: the
+// emulator refuses every netlink protocol it has no translation for, NETLINK_USERSOCK among them,
+// and passes that one through untouched. The frames are the same bytes either way.
+#ifndef KESTREL_HOST_NETLINK_PROTOCOL
+#define KESTREL_HOST_NETLINK_PROTOCOL NETLINK_USERSOCK
+#endif
+
+int platform_netlink_protocol(void) { return KESTREL_HOST_NETLINK_PROTOCOL; }
 
 uint32_t platform_kernel_port_id(void) { return host_environment().kernel_port; }
 

@@ -6,6 +6,8 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include "kestrel_platform.h"
+
 int32_t KernelFrame::word(size_t index) const {
   int32_t v = 0;
   if (payload.size() >= (index + 1) * 4) memcpy(&v, payload.data() + index * 4, 4);
@@ -29,7 +31,7 @@ std::vector<uint8_t> command_frame(uint16_t command, const std::vector<int32_t>&
 }
 
 KernelPeer::KernelPeer(uint32_t port) {
-  fd_ = socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_USERSOCK);
+  fd_ = socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, platform_netlink_protocol());
   if (fd_ < 0) return;
   int size = 4 << 20;
   setsockopt(fd_, SOL_SOCKET, SO_RCVBUFFORCE, &size, sizeof size);
