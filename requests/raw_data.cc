@@ -10,6 +10,7 @@
 #include "request_pattern.h"
 #include "sensor1_messages.h"
 #include "sensor_tables.h"
+#include "service_link/connection.h"
 #include "service_link/factory_state.h"
 #include "status_requests.h"
 
@@ -131,7 +132,15 @@ int get_raw_data(const uint8_t* frame) {
     if (!begin_report_request(&req, name, sensor_type)) return -1;
     // The calibration reset goes out while the report body is already allocated; the
     // sensitivities are in place before the report starts, so its first samples see them.
-    if (sensor_type == kMagSensorType) prepare_mag_stream();
+    if (sensor_type == kMagSensorType) {
+      prepare_mag_stream();
+      // A reset whose write failed has closed the connection the body was taken on: the report
+      // is not written on the closed handle but taken anew, on the connection that opens next.
+      if (req.handle != current_sensor1_handle()) {
+        sensor1_free_msg_buf(current_sensor1_handle(), req.body);
+        if (!begin_report_request(&req, name, sensor_type)) return -1;
+      }
+    }
     fill_report_add(req.body, sensor_type, smgr_id);
     const int r = write_request(&req);
     if (r != 0) KLOGE("[%s]sensor1_write -error  %d\n", name, r);
