@@ -1,0 +1,165 @@
+// The idle footprint: resident memory and threads of a kestreld that has started up, connected
+// to kestrel-sim and finished its start-up threads (the DIAG start thread and the refresh
+// thread), and the CPU time it takes over 60 idle seconds: zero, since nothing in it polls.
+//
+// The daemon runs at a time scale of 0.05, so its start-up delays (5 s, 3 s, 10 s and the DIAG
+// pauses) pass in about a second; memory and idling do not depend on it. KESTREL_BENCH_IDLE_SECONDS
+// shortens the idle period for a quick look.
+#include <stdlib.h>
+#include <unistd.h>
+
+#include <cmath>
+#include <fstream>
+#include <sstream>
+
+#include "bench/bench_support.h"
+#include "kernel_frame.h"
+
+namespace {
+
+using kestrel_bench::ChildProcess;
+
+constexpr double kTimeScale = 0.05;
+constexpr double kRssTargetKib = 4096;
+
+int idle_seconds() {
+  const char* text = getenv("KESTREL_BENCH_IDLE_SECONDS");
+  const int n = text != nullptr ? atoi(text) : 0;
+  return n > 0 ? n : 60;
+}
+
+bool file_contains(const std::string& path, const std::string& text) {
+  std::ifstream in(path);
+  std::stringstream all;
+  all << in.rdbuf();
+  return all.str().find(text) != std::string::npos;
+}
+
+void BM_IdleFootprint(benchmark::State& state) {
+  kestrel_bench::TempDir dir;
+  const std::string socket = dir.file("sensor1.sock");
+  const std::string log = dir.file("kestreld.log");
+  kestrel_bench::NetlinkPort kernel(kestrel_bench::kKernelPort);
+  if (!kernel.ok()) {
+    state.SkipWithError("the kernel side's netlink socket could not be bound");
+    return;
+  }
+  ChildProcess sim({kestrel_bench::kestrel_sim_binary(), "--quiet", "--socket", socket}, {});
+  if (!kestrel_bench::wait_until([&] { return access(socket.c_str(), F_OK) == 0; },
+                                 std::chrono::seconds(10))) {
+    state.SkipWithError("kestrel-sim did not come up");
+    return;
+  }
+  ChildProcess daemon(
+      {kestrel_bench::kestreld_binary()},
+      kestrel_bench::daemon_env(dir, socket, kestrel_bench::kKernelPort, kTimeScale), dir.bin(),
+      log);
+  const pid_t pid = daemon.pid();
+
+  // Idle: connected to the simulator, the refresh thread's frame sent, and only the threads that
+  // last (main and the sensor1 library's) left, for a whole second.
+  std::vector<uint8_t> frame;
+  if (!kernel.receive_type(FRAME_HH_REFRESH, std::chrono::seconds(30), &frame)) {
+    state.SkipWithError("the refresh frame did not come");
+    return;
+  }
+  if (!kestrel_bench::wait_until([&] { return file_contains(log, "open -> 0"); },
+                                 std::chrono::seconds(10))) {
+    state.SkipWithError("kestreld did not connect to kestrel-sim");
+    return;
+  }
+  long threads = -1;
+  int64_t stable_since = kestrel_bench::now_ns();
+  kestrel_bench::wait_until(
+      [&] {
+        const long n = kestrel_bench::process_thread_count(pid);
+        if (n != threads) {
+          threads = n;
+          stable_since = kestrel_bench::now_ns();
+        }
+        return n <= 2 && kestrel_bench::now_ns() - stable_since > 1000000000;
+      },
+      std::chrono::seconds(30));
+
+  const kestrel_bench::ProcessStatus at_start = kestrel_bench::process_status(pid);
+  const long ticks_before = kestrel_bench::process_cpu_ticks(pid);
+  const int64_t cpu_ns_before = kestrel_bench::process_cpu_ns(pid);
+  const long switches_before = kestrel_bench::process_context_switches(pid);
+  const int seconds = idle_seconds();
+  for (auto _ : state) {
+    sleep(static_cast<unsigned>(seconds));
+    state.SetIterationTime(seconds);
+  }
+  const long ticks_after = kestrel_bench::process_cpu_ticks(pid);
+  const int64_t cpu_ns_after = kestrel_bench::process_cpu_ns(pid);
+  const long switches_after = kestrel_bench::process_context_switches(pid);
+  const kestrel_bench::ProcessStatus at_end = kestrel_bench::process_status(pid);
+  if (!daemon.running()) {
+    state.SkipWithError("kestreld ended while idle");
+    return;
+  }
+
+  state.counters["rss_kib"] = static_cast<double>(at_start.rss_kib);
+  state.counters["rss_anon_kib"] = static_cast<double>(at_start.rss_anon_kib);
+  state.counters["rss_file_kib"] = static_cast<double>(at_start.rss_file_kib);
+  state.counters["hwm_kib"] = static_cast<double>(at_start.hwm_kib);
+  state.counters["rss_after_idle_kib"] = static_cast<double>(at_end.rss_kib);
+  state.counters["threads"] = static_cast<double>(at_start.threads);
+  state.counters["idle_s"] = seconds;
+  state.counters["cpu_ticks"] = static_cast<double>(ticks_after - ticks_before);
+  state.counters["cpu_ns"] = static_cast<double>(cpu_ns_after - cpu_ns_before);
+  state.counters["context_switches"] = static_cast<double>(switches_after - switches_before);
+}
+
+BENCHMARK(BM_IdleFootprint)
+    ->Iterations(1)
+    ->Repetitions(1)
+    ->UseManualTime()
+    ->Unit(benchmark::kSecond);
+
+void summarize(const kestrel_bench::RunRecords& runs, kestrel_bench::Summary* summary) {
+  using namespace kestrel_bench;
+  auto it = runs.find("BM_IdleFootprint");
+  auto value = [&](const std::string& key) {
+    if (it == runs.end()) return std::nan("");
+    auto c = it->second.counters.find(key);
+    return c == it->second.counters.end() ? std::nan("") : median(c->second);
+  };
+  const double rss = value("rss_kib");
+  const double idle = value("idle_s");
+  const double ticks = value("cpu_ticks");
+  const double cpu_ns = value("cpu_ns");
+  const double switches = value("context_switches");
+  const std::string over = format_number(idle, 0) + " idle s";
+  summary->add({"idle resident memory (VmRSS)",
+                format_number(rss, 0) + " KiB (" + format_number(rss / 1024, 2) + " MiB)", "4 MiB",
+                format_ratio(rss / kRssTargetKib), "< 4 MiB",
+                verdict(rss < kRssTargetKib, !std::isnan(rss))});
+  summary->add({"  of which anonymous (RssAnon)", format_number(value("rss_anon_kib"), 0) + " KiB",
+                "-", "-", "-", "-"});
+  summary->add({"  of which file-backed (RssFile)",
+                format_number(value("rss_file_kib"), 0) + " KiB", "-", "-", "-", "-"});
+  summary->add({"peak resident memory (VmHWM)", format_number(value("hwm_kib"), 0) + " KiB", "-",
+                "-", "-", "-"});
+  summary->add({"resident memory after the idle period",
+                format_number(value("rss_after_idle_kib"), 0) + " KiB", "-", "-", "-", "-"});
+  summary->add({"threads when idle", format_number(value("threads"), 0), "-", "-", "-", "-"});
+  summary->add({"CPU time over " + over + " (utime+stime)", format_number(ticks, 0) + " ticks", "0",
+                "-", "0", verdict(ticks == 0, !std::isnan(ticks))});
+  summary->add({"CPU time over " + over + " (schedstat)", format_ns(cpu_ns), "-", "-", "-", "-"});
+  summary->add({"context switches over " + over, format_number(switches, 0), "-", "-", "-", "-"});
+  summary->note(
+      "kestreld ran with kestrel-sim connected; measured after the refresh frame had "
+      "come and only the lasting threads were left for a second.");
+  summary->note(
+      "utime+stime from /proc/<pid>/stat in clock ticks; schedstat is the "
+      "nanosecond run time of the daemon's threads; context switches are summed over "
+      "its threads (0: no thread woke up).");
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  kestrel_bench::enter_private_network_namespace(argc, argv);
+  return kestrel_bench::run_benchmarks(argc, argv, "Idle footprint", summarize);
+}
