@@ -8,12 +8,14 @@
 #include <dirent.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>
+#include <string.h>
 #include <sys/types.h>
 
 #include <algorithm>
 #include <chrono>
 #include <memory>
 #include <optional>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -27,6 +29,12 @@ namespace matrix {
 
 using namespace std::chrono_literals;
 using Lines = std::vector<std::string>;
+using Bytes = std::vector<uint8_t>;
+
+inline Lines operator+(Lines a, const Lines& b) {
+  a.insert(a.end(), b.begin(), b.end());
+  return a;
+}
 
 // One log record and the thread that wrote it.
 struct Line {
@@ -45,41 +53,25 @@ inline std::string text_of(const Line& l) {
 // Every record of the daemon's stderr, as liblog writes them:
 //   <tag> <P> <MM-DD> <HH:MM:SS> <pid> <tid> <message>
 // A line that is no record continues the message before it (a message ending in "\n" is followed
-// by an empty line, which gives the message its newline back).
+// by an empty line, which gives the message its newline back). The last line, still being
+// written, is left out.
 inline std::vector<Line> parse_log(const std::string& output) {
+  const auto digits = [](const std::string& s) {
+    return !s.empty() && s.find_first_not_of("0123456789") == std::string::npos;
+  };
   std::vector<Line> out;
-  size_t start = 0;
-  while (start < output.size()) {
-    size_t end = output.find('\n', start);
-    if (end == std::string::npos) break;  // the last line is still being written
+  for (size_t start = 0, end; (end = output.find('\n', start)) != std::string::npos;
+       start = end + 1) {
     const std::string line = output.substr(start, end - start);
-    start = end + 1;
-    size_t pos = 0;
-    std::string fields[6];
-    bool record = true;
-    for (std::string& f : fields) {
-      while (pos < line.size() && line[pos] == ' ') ++pos;
-      const size_t from = pos;
-      while (pos < line.size() && line[pos] != ' ') ++pos;
-      if (pos == from) {
-        record = false;
-        break;
-      }
-      f = line.substr(from, pos - from);
-    }
-    const std::string prio = record ? fields[1] : "";
-    record = record && prio.size() == 1 &&
-             std::string("VDIWEF").find(prio[0]) != std::string::npos && fields[2].size() == 5 &&
-             fields[2][2] == '-' && fields[3].size() == 8 &&
-             fields[4].find_first_not_of("0123456789") == std::string::npos &&
-             fields[5].find_first_not_of("0123456789") == std::string::npos;
-    if (record) {
-      Line l;
-      l.tag = fields[0];
-      l.priority = static_cast<int>(std::string("??VDIWEF").find(prio[0]));
-      l.tid = atol(fields[5].c_str());
-      l.message = pos < line.size() ? line.substr(pos + 1) : "";
-      out.push_back(std::move(l));
+    std::istringstream in(line);
+    std::string tag, prio, date, time, pid, tid;
+    in >> tag >> prio >> date >> time >> pid >> tid;
+    if (prio.size() == 1 && strchr("VDIWEF", prio[0]) != nullptr && date.size() == 5 &&
+        date[2] == '-' && time.size() == 8 && digits(pid) && digits(tid)) {
+      const auto at = in.tellg();
+      const size_t pos = at < 0 ? line.size() : static_cast<size_t>(at);
+      out.push_back({static_cast<int>(std::string("??VDIWEF").find(prio[0])), tag,
+                     atol(tid.c_str()), pos < line.size() ? line.substr(pos + 1) : ""});
     } else if (!out.empty()) {
       out.back().message += "\n" + line;
     }
@@ -96,42 +88,23 @@ inline Lines thread_texts(const std::vector<Line>& lines, long tid) {
   return out;
 }
 
-// The thread that wrote the first record with this exact text, or 0.
-inline long thread_of(const std::vector<Line>& lines, const std::string& text) {
-  for (const Line& l : lines) {
-    if (text_of(l) == text) return l.tid;
-  }
-  return 0;
-}
-
 inline bool starts_with(const std::string& s, const std::string& prefix) {
   return s.compare(0, prefix.size(), prefix) == 0;
 }
 
-inline size_t count_prefix(const Lines& lines, const std::string& prefix) {
-  return static_cast<size_t>(std::count_if(
-      lines.begin(), lines.end(), [&](const std::string& l) { return starts_with(l, prefix); }));
-}
-
-// Threads of a process (entries of /proc/<pid>/task), -1 once it is gone.
-inline int task_count(pid_t pid) {
-  DIR* dir = opendir(("/proc/" + std::to_string(pid) + "/task").c_str());
-  if (dir == nullptr) return -1;
-  int n = 0;
-  while (struct dirent* e = readdir(dir)) {
-    if (e->d_name[0] != '.') ++n;
-  }
-  closedir(dir);
-  return n;
-}
-
+// Threads of a process (entries of /proc/<pid>/task), -1 once it is gone; waits until there are n.
 inline bool wait_for_tasks(pid_t pid, int n, std::chrono::milliseconds timeout) {
   const auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (task_count(pid) != n) {
+  for (;;) {
+    int count = -1;
+    if (DIR* dir = opendir(("/proc/" + std::to_string(pid) + "/task").c_str())) {
+      for (count = 0; struct dirent* e = readdir(dir);) count += e->d_name[0] != '.';
+      closedir(dir);
+    }
+    if (count == n) return true;
     if (std::chrono::steady_clock::now() >= deadline) return false;
     std::this_thread::sleep_for(2ms);
   }
-  return true;
 }
 
 // What the daemon did with one datagram: the main thread's texts from the walk's line of its
@@ -141,6 +114,12 @@ struct Outcome {
   Lines lines;
   std::vector<KernelFrame> frames;
 };
+
+inline std::vector<Bytes> raw_frames(const Outcome& o) {
+  std::vector<Bytes> out;
+  for (const KernelFrame& f : o.frames) out.push_back(f.raw);
+  return out;
+}
 
 // Frames the main thread sends as replies; the others come from the callback and the start-up
 // threads whenever their turn comes.
@@ -176,17 +155,17 @@ class Rig {
 
   // Sends one datagram and then a marker datagram (a command number without an action, unique
   // per call), waits until the main thread has walked the marker, and returns the outcome.
-  Outcome run(const std::vector<uint8_t>& datagram) {
+  Outcome run(const Bytes& datagram) {
     const std::string marker = "process_message: " + std::to_string(next_marker_);
     // What the main thread logged so far belongs to datagrams sent before this one.
-    main_seen_ = std::max(main_seen_, thread_texts(log(), daemon->pid()).size());
+    main_seen_ = std::max(main_seen_, main_lines().size());
     if (!datagram.empty()) {
       EXPECT_TRUE(kernel.send(datagram));
     }
     EXPECT_TRUE(kernel.send(command_frame(static_cast<uint16_t>(next_marker_++))));
     EXPECT_TRUE(daemon->wait_for(marker, 30s)) << daemon->output();
     Outcome out;
-    const Lines main = thread_texts(parse_log(daemon->output()), daemon->pid());
+    const Lines main = main_lines();
     size_t m = main_seen_;
     while (m < main.size() && main[m] != marker) ++m;
     if (!datagram.empty()) {
@@ -211,11 +190,10 @@ class Rig {
   // The next frame of a type that the service callback sends, kept by run() or still to come.
   std::optional<KernelFrame> callback_frame(uint16_t type, std::chrono::milliseconds timeout) {
     for (auto it = late.begin(); it != late.end(); ++it) {
-      if (it->type == type) {
-        KernelFrame f = std::move(*it);
-        late.erase(it);
-        return f;
-      }
+      if (it->type != type) continue;
+      KernelFrame f = std::move(*it);
+      late.erase(it);
+      return f;
     }
     return kernel.receive_type(type, timeout);
   }
@@ -223,16 +201,33 @@ class Rig {
   // Waits until n records carry exactly this text (a trailing newline included).
   bool wait_for_text(const std::string& text, std::chrono::milliseconds timeout, size_t n = 1) {
     const auto deadline = std::chrono::steady_clock::now() + timeout;
-    for (;;) {
-      size_t seen = 0;
-      for (const Line& l : log()) seen += text_of(l) == text ? 1 : 0;
-      if (seen >= n) return true;
+    while (count_text(text) < n) {
       if (std::chrono::steady_clock::now() >= deadline) return false;
       std::this_thread::sleep_for(2ms);
     }
+    return true;
   }
 
-  Lines lines_of_thread(long tid) const { return thread_texts(parse_log(daemon->output()), tid); }
+  size_t count_text(const std::string& text) const {
+    const std::vector<Line> all = log();
+    return std::count_if(all.begin(), all.end(), [&](const Line& l) { return text_of(l) == text; });
+  }
+
+  // The lines of the thread that wrote first_text, from that line on. The handle's address in
+  // the broken-pipe line differs from run to run and is replaced by "<handle>".
+  Lines thread_lines_from(const std::string& first_text) const {
+    const std::vector<Line> all = log();
+    auto first = std::find_if(all.begin(), all.end(),
+                              [&](const Line& l) { return text_of(l) == first_text; });
+    Lines texts = thread_texts(all, first == all.end() ? 0 : first->tid);
+    Lines out(std::find(texts.begin(), texts.end(), first_text), texts.end());
+    for (std::string& l : out) {
+      if (starts_with(l, "BROKEN_PIPE sensor1_handle 0x")) l = "BROKEN_PIPE sensor1_handle <handle>\n";
+    }
+    return out;
+  }
+
+  Lines main_lines() const { return thread_texts(log(), daemon->pid()); }
   std::vector<Line> log() const { return parse_log(daemon->output()); }
 
   kestrel_sim::Simulator sim;
@@ -251,6 +246,31 @@ inline std::vector<int32_t> words_of(const KernelFrame& f) {
   std::vector<int32_t> w;
   for (size_t i = 0; i + 4 <= f.payload.size(); i += 4) w.push_back(f.word(i / 4));
   return w;
+}
+
+// A reply payload of signed 32-bit words.
+inline Bytes payload(const std::vector<int32_t>& words) {
+  Bytes out(words.size() * 4);
+  if (!words.empty()) memcpy(out.data(), words.data(), out.size());
+  return out;
+}
+
+// The frame as the daemon sends it: header (nlmsg_pid 20000) and payload with its alignment.
+inline Bytes frame_bytes(uint16_t type, Bytes body) {
+  const uint32_t len = (static_cast<uint32_t>(body.size()) + 19) & ~3u, pid = 20000;
+  Bytes f(16, 0);
+  memcpy(f.data(), &len, 4);
+  memcpy(f.data() + 4, &type, 2);
+  memcpy(f.data() + 12, &pid, 4);
+  body.resize(len - 16, 0);
+  f.insert(f.end(), body.begin(), body.end());
+  return f;
+}
+
+// The self-test reply of the accelerometer from its eight result words.
+inline Bytes accel_reply(const std::vector<int32_t>& w) {
+  return frame_bytes(9, payload({0, w[0], w[4], w[5], w[6], w[7], w[1], w[2], w[3], 0, 0, 0, 0,
+                                 0, 0, 0, 0, 0}));
 }
 
 }  // namespace matrix

@@ -8,6 +8,7 @@
 
 #include <optional>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "tests/e2e/matrix_support.h"
@@ -18,229 +19,108 @@ using namespace matrix;
 using kestrel_sim::FaultOp;
 using kestrel_sim::Request;
 
-constexpr int32_t kAllocError = 12;
-constexpr int32_t kWriteError = 5;
+const char kClosed[] = "libsensor1: close -> 0";
 
 struct Kind {
   const char* name;
-  std::vector<uint8_t> command;
+  Bytes command;
   bool closing;            // a failed write closes the connection
-  uint32_t requests;       // requests the command writes when nothing fails
-  int callback_frame;      // frame type the callback sends for the answer, -1 for none
   Lines alloc;             // main-thread lines from the walk's line on, every allocation failing
   bool reply_after_alloc;  // the reply still goes out, built from the stored results
-  Lines write_error;       // the same when the write fails with kWriteError
+  Lines write_error;       // the same when the write fails with 5
   bool reply_after_write;
-  // Where the write failure needs another command to reach the request alone.
-  std::optional<std::vector<uint8_t>> write_error_command = std::nullopt;
-  // The message ids of the requests that command still writes after the failure, on the
-  // connection it opens itself.
+  uint32_t requests = 1;    // requests the command writes when nothing fails
+  int callback_frame = -1;  // frame type the callback sends for the answer, -1 for none
+  // Where the write failure needs another command to reach the request alone, and the message
+  // ids of the requests that command still writes after the failure, on the connection it opens.
+  std::optional<Bytes> write_error_command = std::nullopt;
   std::vector<int32_t> requests_after_write_error = {};
 };
 
-std::vector<uint8_t> bigdata_28() {
-  // sensor_type 4, 4 data bytes 01 02 03 04.
-  return command_frame_bytes(28, {4, 0, 0, 0, 4, 0, 0, 0, 1, 2, 3, 4});
-}
+std::string pm(int n) { return "process_message: " + std::to_string(n); }
+std::string alloc(const std::string& name) { return "[" + name + "]sensor1_alloc_msg_buf error - 12\n"; }
+std::string write5(const std::string& name) { return "[" + name + "]sensor1_write -error  5\n"; }
 
 std::vector<Kind> kinds() {
-  const std::string write5 = std::to_string(kWriteError);
-  const Lines closed = {"libsensor1: close -> 0"};
-  auto plus = [](Lines a, const Lines& b) {
-    a.insert(a.end(), b.begin(), b.end());
-    return a;
-  };
-  Lines hidden_hole = {"process_message: 35"};
+  const std::string get_raw12 = "get_raw error get_raw_data returned 12\n";
+  Lines hidden_hole = {pm(35)};
   const char* names[] = {"sensor_type", "d_factor", "r_coef",    "g_coef",  "b_coef",
                          "c_coef",      "ct_coef",  "ct_offset", "th_high", "th_low"};
   for (int i = 0; i < 10; ++i) {
     hidden_hole.push_back(std::string("set_hidden_hole_data ") + names[i] + ":" +
                           std::to_string(i == 0 ? 4 : i) + "\n");
   }
+  const std::string dump = "process_message: NETLINK_MESSAGE_DUMP_REGISTER - sensor_type (0)";
+  const std::string mag = "get_mag_register_data: sensor_type = 8, pdata_sensor_type:2, id=20, "
+                          "send_to_kernel=1\n";
+  const std::string store[] = {"store_calib_data: Enter\n", "store_calib_data: sensor_type = 0 \n"};
+  const std::string selftest = "get_selftest_result: sensor_type = 0, id = 0\n";
+  const std::string lpf = "set_accel_lpf: sensor_type = 12, id = 0\n";
+  const std::string lpf_out = "send_accel_lpf_result OUT: test type = 11, lpf_on_off = 1\n";
   return {
-      {"get_status",
-       command_frame(0, {0}),
-       true,
-       1,
-       -1,
-       {"process_message: 0", "[get_status]sensor1_alloc_msg_buf error - 12\n"},
-       false,
-       plus({"process_message: 0", "[get_status]sensor1_write -error  5\n"}, closed),
-       false},
-      {"get_raw_data, sensor manager",
-       command_frame(1, {0}),
-       false,
-       1,
-       -1,
-       {"process_message: 1", "[get_raw_data]sensor1_alloc_msg_buf error - 12\n"},
-       false,
-       {"process_message: 1", "[get_raw_data]sensor1_write -error  5\n",
-        "get_raw_data: sensor_type = 0 txn_id = 2\n"},
-       false},
-      {"get_raw_data, light sensor",
-       command_frame(1, {4}),
-       false,
-       1,
-       -1,
-       {"process_message: 1", "get_raw error get_raw_data returned 12\n"},
-       false,
-       {"process_message: 1", "get_raw_data sensor_type:4\n",
-        "[DAF][get_raw_data]sensor1_write -error  5 4\n",
-        "get_raw_data: sensor_type = 40 txn_id = 123\n"},
-       false},
-      {"stop_raw_data, sensor manager",
-       command_frame(3, {0}),
-       false,
-       1,
-       -1,
-       {"process_message: 3", "[stop_raw_data]sensor1_alloc_msg_buf error - 12\n"},
-       false,
-       {"process_message: 3", "[stop_raw_data]sensor1_write -error  5 0\n",
-        "stop_raw_data: sensor_type = 0 txn_id = 2\n"},
-       true},
-      {"stop_raw_data, light sensor",
-       command_frame(3, {4}),
-       false,
-       1,
-       -1,
-       {"process_message: 3", "get_raw error get_raw_data returned 12\n"},
-       false,
-       {"process_message: 3", "stop_raw_data sensor_type:4\n",
-        "[DAF][stop_raw_data]sensor1_write -error  5 4\n",
-        "stop_raw_data: sensor_type = 40 txn_id = 123\n"},
-       true},
-      {"store_calib_data",
-       command_frame(6, {0, 1}),
-       true,
-       1,
-       -1,
-       {"process_message: 6", "store_calib_data: Enter\n", "store_calib_data: sensor_type = 0 \n",
-        "[store_calib_data]sensor1_alloc_msg_buf error - 12\n"},
-       false,
-       plus({"process_message: 6", "store_calib_data: Enter\n",
-             "store_calib_data: sensor_type = 0 \n", "store_calib_data: CAL(1)",
-             "store_calib_data: SensorID:0, DataType:0",
-             "[store_calib_data]sensor1_write -error  5\n"},
-            closed),
-       false},
-      {"get_selftest_result",
-       command_frame(8, {0}),
-       true,
-       1,
-       -1,
-       {"process_message: 8", "get_selftest_result: sensor_type = 0, id = 0\n",
-        "[get_selftest_result]sensor1_alloc_msg_buf error - 12\n"},
-       true,
-       plus({"process_message: 8", "get_selftest_result: sensor_type = 0, id = 0\n",
-             "get_selftest_result: LSM6DSM ACCEL SELFTEST, TestType = (6)\n",
-             "get_selftest_result: msg_hdr.msg_id = 0xd, id = 0\n",
-             "[get_selftest_result]sensor1_write -error  5\n"},
-            closed),
-       true},
+      {"get_status", command_frame(0, {0}), true, {pm(0), alloc("get_status")}, false,
+       {pm(0), write5("get_status"), kClosed}, false},
+      {"get_raw_data, sensor manager", command_frame(1, {0}), false,
+       {pm(1), alloc("get_raw_data")}, false,
+       {pm(1), write5("get_raw_data"), "get_raw_data: sensor_type = 0 txn_id = 2\n"}, false},
+      {"get_raw_data, light sensor", command_frame(1, {4}), false, {pm(1), get_raw12}, false,
+       {pm(1), "get_raw_data sensor_type:4\n", "[DAF][get_raw_data]sensor1_write -error  5 4\n",
+        "get_raw_data: sensor_type = 40 txn_id = 123\n"}, false},
+      {"stop_raw_data, sensor manager", command_frame(3, {0}), false,
+       {pm(3), alloc("stop_raw_data")}, false,
+       {pm(3), "[stop_raw_data]sensor1_write -error  5 0\n",
+        "stop_raw_data: sensor_type = 0 txn_id = 2\n"}, true},
+      {"stop_raw_data, light sensor", command_frame(3, {4}), false, {pm(3), get_raw12}, false,
+       {pm(3), "stop_raw_data sensor_type:4\n", "[DAF][stop_raw_data]sensor1_write -error  5 4\n",
+        "stop_raw_data: sensor_type = 40 txn_id = 123\n"}, true},
+      {"store_calib_data", command_frame(6, {0, 1}), true,
+       {pm(6), store[0], store[1], alloc("store_calib_data")}, false,
+       {pm(6), store[0], store[1], "store_calib_data: CAL(1)",
+        "store_calib_data: SensorID:0, DataType:0", write5("store_calib_data"), kClosed}, false},
+      {"get_selftest_result", command_frame(8, {0}), true,
+       {pm(8), selftest, alloc("get_selftest_result")}, true,
+       {pm(8), selftest, "get_selftest_result: LSM6DSM ACCEL SELFTEST, TestType = (6)\n",
+        "get_selftest_result: msg_hdr.msg_id = 0xd, id = 0\n", write5("get_selftest_result"),
+        kClosed}, true},
+      // The reset goes out while the report body of a magnetometer stream start is held. Its
+      // failure closes the connection the body was taken on, so the report is taken anew on a
+      // new connection and written there.
       {"reset_mag_cal (after the magnetometer self test; beside a magnetometer stream start)",
-       command_frame(8, {2}),
+       command_frame(8, {2}), true,
+       {pm(8), "get_selftest_result: sensor_type = 2, id = 20\n", alloc("get_selftest_result"),
+        "send_mag_selftest_result: id == SNS_SMGR_ID_MAG_V01", alloc("reset_mag_cal")}, true,
+       {pm(1), "get_raw_data: Reset Mag Cal IN", write5("reset_mag_cal"), kClosed,
+        "get_raw_data: Reset Mag Cal OUT", "libsensor1: open -> 0",
+        "sensor1_open_or_reopen: sensor1_open success\n", "get_handle_for_sensor: id:2\n",
+        "get_raw_data: sensor_type = 20 txn_id = 2\n"}, false, 2, -1, command_frame(1, {2}), {2}},
+      {"get_mag_register_data", command_frame(11), true,
+       {pm(11), mag, alloc("get_mag_register_data")}, false,
+       {pm(11), mag, "get_mag_register_data: MAG Read Fuserom\n",
+        "get_mag_register_data: msg_hdr.msg_id = 0xd, id = 20\n", write5("get_mag_register_data"),
+        kClosed}, false},
+      {"set_accel_lpf", command_frame(15), true, {pm(15), lpf, alloc("set_accel_lpf"), lpf_out},
        true,
-       2,
-       -1,
-       {"process_message: 8", "get_selftest_result: sensor_type = 2, id = 20\n",
-        "[get_selftest_result]sensor1_alloc_msg_buf error - 12\n",
-        "send_mag_selftest_result: id == SNS_SMGR_ID_MAG_V01",
-        "[reset_mag_cal]sensor1_alloc_msg_buf error - 12\n"},
-       true,
-       // The reset goes out while the report body is held. Its failure closes the connection
-       // the body was taken on, so the report is taken anew on a new connection and written there.
-       plus(plus({"process_message: 1", "get_raw_data: Reset Mag Cal IN",
-                  "[reset_mag_cal]sensor1_write -error  5\n"},
-                 closed),
-            {"get_raw_data: Reset Mag Cal OUT", "libsensor1: open -> 0",
-             "sensor1_open_or_reopen: sensor1_open success\n", "get_handle_for_sensor: id:2\n",
-             "get_raw_data: sensor_type = 20 txn_id = 2\n"}),
-       false,
-       command_frame(1, {2}),
-       {2}},
-      {"get_mag_register_data",
-       command_frame(11),
-       true,
-       1,
-       -1,
-       {"process_message: 11",
-        "get_mag_register_data: sensor_type = 8, pdata_sensor_type:2, id=20, send_to_kernel=1\n",
-        "[get_mag_register_data]sensor1_alloc_msg_buf error - 12\n"},
-       false,
-       plus({"process_message: 11",
-             "get_mag_register_data: sensor_type = 8, pdata_sensor_type:2, id=20, "
-             "send_to_kernel=1\n",
-             "get_mag_register_data: MAG Read Fuserom\n",
-             "get_mag_register_data: msg_hdr.msg_id = 0xd, id = 20\n",
-             "[get_mag_register_data]sensor1_write -error  5\n"},
-            closed),
-       false},
-      {"set_accel_lpf",
-       command_frame(15),
-       true,
-       1,
-       -1,
-       {"process_message: 15", "set_accel_lpf: sensor_type = 12, id = 0\n",
-        "[set_accel_lpf]sensor1_alloc_msg_buf error - 12\n",
-        "send_accel_lpf_result OUT: test type = 11, lpf_on_off = 1\n"},
-       true,
-       plus(plus({"process_message: 15", "set_accel_lpf: sensor_type = 12, id = 0\n",
-                  "set_accel_lpf: K6DS3 ACCEL LPF ON\n",
-                  "set_accel_lpf: msg_hdr.msg_id = 0xd, id = 0\n",
-                  "[set_accel_lpf]sensor1_write -error  5\n"},
-                 closed),
-            {"send_accel_lpf_result OUT: test type = 11, lpf_on_off = 1\n"}),
+       {pm(15), lpf, "set_accel_lpf: K6DS3 ACCEL LPF ON\n",
+        "set_accel_lpf: msg_hdr.msg_id = 0xd, id = 0\n", write5("set_accel_lpf"), kClosed, lpf_out},
        true},
-      {"set_accel_motor",
-       command_frame(17),
-       false,
-       1,
-       -1,
-       {"process_message: 17", "set_accel_motor sensor1_alloc_msg_buf error:12\n"},
-       false,
-       {"process_message: 17", "[DAF][set_accel_motor]sensor1_write -error  5 14\n",
-        "set_accel_motor: Send Motor Enabled state done"},
-       false},
-      {"dump_register",
-       command_frame(19, {0}),
-       false,
-       1,
-       20,
-       {"process_message: 19", "process_message: NETLINK_MESSAGE_DUMP_REGISTER - sensor_type (0)",
-        "dump_register sensor1_alloc_msg_buf error:12\n"},
-       false,
-       {"process_message: 19", "process_message: NETLINK_MESSAGE_DUMP_REGISTER - sensor_type (0)",
-        "[DAF][dump_register]sensor1_write error 5\n"},
-       false},
-      {"send_bigdata",
-       bigdata_28(),
-       false,
-       1,
-       30,
-       {"process_message: 28", "send_bigdata sensor1_alloc_msg_buf error:12\n"},
-       false,
-       {"process_message: 28", "send_bigdata: type:28, id:40",
-        "[DAF][send_bigdata]sensor1_write -error  5 4\n"},
-       false},
-      {"set_hidden_hole_data",
-       command_frame(35, {4, 1, 2, 3, 4, 5, 6, 7, 8, 9}),
-       false,
-       1,
-       -1,
-       {"process_message: 35", "get_raw error get_raw_data returned 12\n"},
-       false,
-       plus(hidden_hole, {"[DAF][set_hidden_hole_data]sensor1_write -error  5 4\n",
-                          "set_hidden_hole_data: sensor_type = 40 txn_id = 123\n"}),
-       false},
-      {"get_sensor_state",
-       command_frame(27, {0, 2}),
-       true,
-       1,
-       -1,
-       {"process_message: 27", "[get_sensor_state]sensor1_alloc_msg_buf error - 12\n"},
-       false,
-       plus({"process_message: 27", "[get_sensor_state]sensor1_write -error  5\n"}, closed),
-       false},
+      {"set_accel_motor", command_frame(17), false,
+       {pm(17), "set_accel_motor sensor1_alloc_msg_buf error:12\n"}, false,
+       {pm(17), "[DAF][set_accel_motor]sensor1_write -error  5 14\n",
+        "set_accel_motor: Send Motor Enabled state done"}, false},
+      {"dump_register", command_frame(19, {0}), false,
+       {pm(19), dump, "dump_register sensor1_alloc_msg_buf error:12\n"}, false,
+       {pm(19), dump, "[DAF][dump_register]sensor1_write error 5\n"}, false, 1, 20},
+      // sensor_type 4, 4 data bytes 01 02 03 04.
+      {"send_bigdata", command_frame_bytes(28, {4, 0, 0, 0, 4, 0, 0, 0, 1, 2, 3, 4}), false,
+       {pm(28), "send_bigdata sensor1_alloc_msg_buf error:12\n"}, false,
+       {pm(28), "send_bigdata: type:28, id:40", "[DAF][send_bigdata]sensor1_write -error  5 4\n"},
+       false, 1, 30},
+      {"set_hidden_hole_data", command_frame(35, {4, 1, 2, 3, 4, 5, 6, 7, 8, 9}), false,
+       {pm(35), get_raw12}, false,
+       hidden_hole + Lines{"[DAF][set_hidden_hole_data]sensor1_write -error  5 4\n",
+                           "set_hidden_hole_data: sensor_type = 40 txn_id = 123\n"}, false},
+      {"get_sensor_state", command_frame(27, {0, 2}), true, {pm(27), alloc("get_sensor_state")},
+       false, {pm(27), write5("get_sensor_state"), kClosed}, false},
   };
 }
 
@@ -253,47 +133,18 @@ Lines without_race(Lines lines) {
   return lines;
 }
 
-std::vector<std::vector<uint8_t>> raw_frames(const Outcome& o) {
-  std::vector<std::vector<uint8_t>> out;
-  for (const KernelFrame& f : o.frames) out.push_back(f.raw);
-  return out;
-}
-
-std::vector<Request> take_requests(kestrel_sim::Simulator& sim, uint32_t n) {
-  std::vector<Request> out;
-  for (uint32_t i = 0; i < n; ++i) {
+// The next n requests the simulator received, as (connection, service, msg id, size, txn, body).
+using Sent = std::tuple<int, int, int, int, int, Bytes>;
+std::vector<Sent> take_requests(kestrel_sim::Simulator& sim, size_t n) {
+  std::vector<Sent> out;
+  while (out.size() < n) {
     auto r = sim.next_request(5s);
-    EXPECT_TRUE(r) << "request " << i + 1 << " of " << n;
+    EXPECT_TRUE(r) << "request " << out.size() + 1 << " of " << n;
     if (!r) break;
-    out.push_back(std::move(*r));
+    out.emplace_back(r->connection, r->header.service, r->header.msg_id, r->header.msg_size,
+                     r->header.txn_id, r->body);
   }
   return out;
-}
-
-void expect_same_requests(const std::vector<Request>& got, const std::vector<Request>& want) {
-  ASSERT_EQ(got.size(), want.size());
-  for (size_t i = 0; i < got.size(); ++i) {
-    EXPECT_EQ(got[i].connection, want[i].connection);
-    EXPECT_EQ(got[i].header.service, want[i].header.service);
-    EXPECT_EQ(got[i].header.msg_id, want[i].header.msg_id);
-    EXPECT_EQ(got[i].header.msg_size, want[i].header.msg_size);
-    EXPECT_EQ(got[i].header.txn_id, want[i].header.txn_id);
-    EXPECT_EQ(got[i].body, want[i].body);
-  }
-}
-
-// After the closing variant has closed the connection, the next command opens a new one on the
-// main thread before it writes, and its request goes out on that connection.
-void expect_reopen_on_next_command(Rig& rig, int connection) {
-  ASSERT_TRUE(rig.sim.wait_for_disconnect(5s)) << "the failed write closed the connection";
-  const Outcome probe = rig.run(command_frame(27, {0, 2}));
-  EXPECT_THAT(probe.lines, ::testing::ElementsAre("process_message: 27", "libsensor1: open -> 0",
-                                                  "sensor1_open_or_reopen: sensor1_open success\n",
-                                                  "get_handle_for_sensor: id:0\n"));
-  auto r = rig.sim.next_request(5s);
-  ASSERT_TRUE(r);
-  EXPECT_EQ(r->header.msg_id, 64);
-  EXPECT_EQ(r->connection, connection);
 }
 
 TEST(RequestFaultMatrix, EveryRequestSurvivesAllocationAndWriteFailures) {
@@ -301,13 +152,21 @@ TEST(RequestFaultMatrix, EveryRequestSurvivesAllocationAndWriteFailures) {
   rig.start();
   rig.wait_until_settled();
   int connection = 1;
+  // After a closing request closed the connection, the next command opens a new one on the main
+  // thread before it writes, and its request goes out there; the last one checks that no request
+  // went out that the cases did not expect.
+  auto expect_next_request_on = [&](const Lines& lines) {
+    EXPECT_EQ(rig.run(command_frame(27, {0, 2})).lines, lines);
+    const auto next = take_requests(rig.sim, 1);
+    ASSERT_EQ(next.size(), 1u);
+    EXPECT_EQ(std::get<0>(next[0]), connection);
+    EXPECT_EQ(std::get<2>(next[0]), 64);
+  };
   for (const Kind& kind : kinds()) {
     SCOPED_TRACE(kind.name);
-    const uint32_t count = kind.requests;
-
     // Nothing fails: the reference run.
     const Outcome healthy = rig.run(kind.command);
-    const std::vector<Request> sent = take_requests(rig.sim, kind.requests);
+    const auto sent = take_requests(rig.sim, kind.requests);
     ASSERT_EQ(sent.size(), kind.requests) << rig.daemon->output();
     std::optional<KernelFrame> answer;
     if (kind.callback_frame >= 0) {
@@ -317,22 +176,19 @@ TEST(RequestFaultMatrix, EveryRequestSurvivesAllocationAndWriteFailures) {
 
     // The allocation fails: the failure line, nothing written, and the reply only where it is
     // built from the stored results.
-    ASSERT_TRUE(rig.sim.fault(FaultOp::kAlloc, kAllocError, count));
-    const Outcome alloc = rig.run(kind.command);
-    EXPECT_EQ(alloc.lines, kind.alloc);
-    if (kind.reply_after_alloc) {
-      EXPECT_EQ(raw_frames(alloc), raw_frames(healthy));
-      EXPECT_FALSE(alloc.frames.empty());
-    } else {
-      EXPECT_TRUE(alloc.frames.empty());
-    }
+    ASSERT_TRUE(rig.sim.fault(FaultOp::kAlloc, 12, kind.requests));
+    const Outcome failed_alloc = rig.run(kind.command);
+    EXPECT_EQ(failed_alloc.lines, kind.alloc);
+    EXPECT_EQ(raw_frames(failed_alloc),
+              kind.reply_after_alloc ? raw_frames(healthy) : std::vector<Bytes>());
+    EXPECT_FALSE(healthy.frames.empty() && kind.reply_after_alloc);
 
     // The write returns 11: the request goes out and everything happens as without a fault.
-    ASSERT_TRUE(rig.sim.fault(FaultOp::kWrite, 11, count));
+    ASSERT_TRUE(rig.sim.fault(FaultOp::kWrite, 11, kind.requests));
     const Outcome would_block = rig.run(kind.command);
     EXPECT_EQ(without_race(would_block.lines), without_race(healthy.lines));
     EXPECT_EQ(raw_frames(would_block), raw_frames(healthy));
-    expect_same_requests(take_requests(rig.sim, kind.requests), sent);
+    EXPECT_EQ(take_requests(rig.sim, kind.requests), sent);
     if (answer) {
       auto again = rig.callback_frame(answer->type, 5s);
       ASSERT_TRUE(again);
@@ -340,35 +196,30 @@ TEST(RequestFaultMatrix, EveryRequestSurvivesAllocationAndWriteFailures) {
     }
 
     // The write fails and the close succeeds.
-    ASSERT_TRUE(rig.sim.fault(FaultOp::kWrite, kWriteError, 1));
+    ASSERT_TRUE(rig.sim.fault(FaultOp::kWrite, 5, 1));
     const Outcome failed = rig.run(kind.write_error_command.value_or(kind.command));
     EXPECT_EQ(failed.lines, kind.write_error);
-    if (kind.reply_after_write) {
-      EXPECT_EQ(raw_frames(failed), raw_frames(healthy));
-      EXPECT_FALSE(failed.frames.empty());
-    } else {
-      EXPECT_TRUE(failed.frames.empty());
-    }
+    EXPECT_EQ(raw_frames(failed),
+              kind.reply_after_write ? raw_frames(healthy) : std::vector<Bytes>());
+    EXPECT_FALSE(healthy.frames.empty() && kind.reply_after_write);
     if (!kind.requests_after_write_error.empty()) {
       ++connection;
-      const auto after =
-          take_requests(rig.sim, static_cast<uint32_t>(kind.requests_after_write_error.size()));
+      const auto after = take_requests(rig.sim, kind.requests_after_write_error.size());
       for (size_t i = 0; i < after.size(); ++i) {
-        EXPECT_EQ(after[i].connection, connection);
-        EXPECT_EQ(after[i].header.msg_id, kind.requests_after_write_error[i]);
+        EXPECT_EQ(std::get<0>(after[i]), connection);
+        EXPECT_EQ(std::get<2>(after[i]), kind.requests_after_write_error[i]);
       }
     } else if (kind.closing) {
-      expect_reopen_on_next_command(rig, ++connection);
+      ++connection;
+      ASSERT_TRUE(rig.sim.wait_for_disconnect(5s)) << "the failed write closed the connection";
+      expect_next_request_on({pm(27), "libsensor1: open -> 0",
+                              "sensor1_open_or_reopen: sensor1_open success\n",
+                              "get_handle_for_sensor: id:0\n"});
     } else {
       EXPECT_EQ(rig.sim.current_connection(), connection);
     }
   }
-  // No request went out that the cases did not expect: the next one is this last command's.
-  rig.run(command_frame(27, {0, 2}));
-  auto last = rig.sim.next_request(5s);
-  ASSERT_TRUE(last);
-  EXPECT_EQ(last->header.msg_id, 64);
-  EXPECT_EQ(last->connection, connection);
+  expect_next_request_on({pm(27)});
   EXPECT_FALSE(rig.daemon->wait_exit(0ms)) << "the daemon still runs";
 }
 
@@ -381,23 +232,18 @@ TEST(RequestFaultMatrix, AFailedWriteWhoseCloseFailsEndsTheDaemonWithTheCloseRes
     Rig rig;
     rig.start();
     rig.wait_until_settled();
-    ASSERT_TRUE(rig.sim.fault(FaultOp::kWrite, kWriteError, 1));
+    ASSERT_TRUE(rig.sim.fault(FaultOp::kWrite, 5, 1));
     ASSERT_TRUE(rig.sim.fault(FaultOp::kClose, status, 1));
-    const std::vector<uint8_t> command = kind.write_error_command.value_or(kind.command);
-    ASSERT_TRUE(rig.kernel.send(command));
+    ASSERT_TRUE(rig.kernel.send(kind.write_error_command.value_or(kind.command)));
     EXPECT_EQ(rig.daemon->wait_exit(10s), status);
     const std::string last = "sensor1_close returned " + std::to_string(status) + "\n";
     ASSERT_TRUE(rig.daemon->wait_for(last, 5s)) << rig.daemon->output();
     // The lines up to the write failure are those of the closing run above; then the close
     // with its result, and the process ends.
-    Lines expected;
-    for (const std::string& l : kind.write_error) {
-      if (l == "libsensor1: close -> 0") break;
-      expected.push_back(l);
-    }
-    expected.push_back("libsensor1: close -> " + std::to_string(status));
-    expected.push_back(last);
-    Lines main = rig.lines_of_thread(rig.daemon->pid());
+    const auto close = std::find(kind.write_error.begin(), kind.write_error.end(), kClosed);
+    const Lines expected = Lines(kind.write_error.begin(), close) +
+                           Lines{"libsensor1: close -> " + std::to_string(status), last};
+    const Lines main = rig.main_lines();
     auto walk = std::find(main.begin(), main.end(), expected.front());
     ASSERT_NE(walk, main.end());
     EXPECT_EQ(Lines(walk, main.end()), expected);
