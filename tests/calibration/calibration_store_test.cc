@@ -73,13 +73,13 @@ TEST_F(CalibrationStoreTest, FailedWriteClosesTheConnectionAndSendsNoReply) {
   answer_tests();
   command(6, {2, 0});
   EXPECT_EQ(next().connection, 2);
-  const std::optional<KernelFrame> f = kernel->receive(4000ms);
+  const std::optional<Frame> f = kernel->next_frame(4000ms);
   ASSERT_TRUE(f.has_value());
   EXPECT_EQ(f->raw, word_frame(7, {2, 0}));
 }
 
 TEST(CalibrationStoreDeathTest, FailedCloseAfterAFailedWriteEndsTheProcess) {
-  const Bytes frame = command_frame(6, {0, 0});
+  const Bytes frame = build_command(6, {0, 0});
   expect_exit_on_failing_close([&] { store_calib_data(frame.data()); }, "store_calib_data");
 }
 

@@ -10,7 +10,7 @@ namespace {
 Bytes bigdata(uint16_t command, int32_t length, const Bytes& data, int32_t sensor_type = 4) {
   Bytes payload = words({sensor_type, length});
   payload.insert(payload.end(), data.begin(), data.end());
-  return command_frame_bytes(command, payload);
+  return build_frame(command, payload);
 }
 
 Bytes counting(size_t n) {

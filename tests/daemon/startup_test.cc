@@ -13,7 +13,7 @@
 #include <chrono>
 
 #include "daemon_process.h"
-#include "kernel_peer.h"
+#include "kernel_port.h"
 
 using ::testing::ElementsAre;
 using ::testing::ElementsAreArray;
@@ -63,7 +63,8 @@ int hold_guard_port() {
 }
 
 TEST(StartupTest, LogsItsStartInOrderAndEntersTheReceiveLoop) {
-  KernelPeer kernel(100);
+  kestrelctl::KernelPort kernel;
+  ASSERT_TRUE(kernel.open_bound(100));
   const auto started = std::chrono::steady_clock::now();
   DaemonProcess daemon;
   ASSERT_TRUE(daemon.wait_for("main: do while start = 0\n", 10s)) << daemon.output();
@@ -103,8 +104,8 @@ TEST(StartupTest, Sensor1InitFailureEndsWithStatusSix) {
 
 TEST(StartupTest, HeldNetlinkPortEndsMainWithStatusZeroAndNoThread) {
   // Another socket already holds the daemon's port id 20000.
-  KernelPeer squatter(20000);
-  ASSERT_TRUE(squatter.ok());
+  kestrelctl::KernelPort squatter;
+  ASSERT_TRUE(squatter.open_bound(20000));
   DaemonProcess daemon;
   EXPECT_EQ(daemon.wait_exit(10s), 0);
   const auto lines = daemon.messages();
@@ -119,10 +120,11 @@ TEST(StartupTest, HeldNetlinkPortEndsMainWithStatusZeroAndNoThread) {
 // The refresh request: frame type 34, the 16-bit value 260, 20 bytes, no earlier than 10 s after
 // the thread started (and the thread starts after the 5 s start delay).
 void expect_refresh_frame(std::chrono::milliseconds scale_5_plus_10, double scale) {
-  KernelPeer kernel(100);
+  kestrelctl::KernelPort kernel;
+  ASSERT_TRUE(kernel.open_bound(100));
   const auto started = std::chrono::steady_clock::now();
   DaemonProcess daemon(DaemonEnv{{"KESTREL_TIME_SCALE", std::to_string(scale)}});
-  auto frame = kernel.receive_type(34, scale_5_plus_10 + 10s);
+  auto frame = kernel.next_frame_of_type(34, scale_5_plus_10 + 10s);
   ASSERT_TRUE(frame) << daemon.output();
   EXPECT_GE(std::chrono::steady_clock::now() - started, scale_5_plus_10);
   EXPECT_THAT(frame->raw, ElementsAre(20, 0, 0, 0, 34, 0, 0, 0, 0, 0, 0, 0, 0x20, 0x4e, 0, 0, 0x04,
@@ -133,6 +135,8 @@ TEST(StartupTest, RefreshFrameComesTenScaledSecondsAfterTheThreadStarts) {
   expect_refresh_frame(scaled(15000ms), test_time_scale());
 }
 
-TEST(StartupTest, RefreshFrameAtRealTime) { expect_refresh_frame(15000ms, 1.0); }
+TEST(StartupTest, RefreshFrameAtRealTime) {
+  expect_refresh_frame(15000ms, 1.0);
+}
 
 }  // namespace

@@ -4,7 +4,7 @@
 
 #include "daemon_process.h"
 #include "diag_fixture.h"
-#include "kernel_peer.h"
+#include "kernel_port.h"
 #include "tools/sim/simulator.h"
 
 namespace {
@@ -39,14 +39,14 @@ TEST(DiagDaemon, BootLeavesLoggingOffWhenLibdiagFails) {
   for (const Case& c : cases) {
     SCOPED_TRACE(c.env.begin()->first);
     kestrel_sim::Simulator sim(test_socket_path(), true);
-    KernelPeer kernel(100);
-    ASSERT_TRUE(kernel.ok());
+    kestrelctl::KernelPort kernel;
+    ASSERT_TRUE(kernel.open_bound(100));
     FakeTools tools;
     DaemonProcess daemon(c.env, tools.dir());
 
     ASSERT_TRUE(daemon.wait_for(c.expected.back().substr(2) + "\n", 20000ms)) << daemon.output();
     // The state is still 0: a dump finds logging disabled, and the tool never ran.
-    ASSERT_TRUE(kernel.send(command_frame(27, {0, 0})));
+    ASSERT_TRUE(kernel.send(kestrelctl::build_command(27, {0, 0})));
     ASSERT_TRUE(daemon.wait_for("diag : Diabled Logging System\n", 5000ms)) << daemon.output();
     EXPECT_EQ(without_newlines(view(daemon.records(),
                                     {"diag_logging", "sensor1_open_or_reopen: sensor1_open success",

@@ -1,5 +1,5 @@
 // Shared by the fault-matrix tests: kestreld runs as a child process (DaemonProcess), the kernel
-// driver is a KernelPeer on port 100, the sensor processor an in-process Simulator and the shell
+// driver is a KernelPort on port 100, the sensor processor an in-process Simulator and the shell
 // tools recording stand-ins. Beside what DaemonProcess parses, the log is read here with the
 // thread id of every record, so a case can look at the lines of the main thread alone (its thread
 // id is the process id) or of the sensor1 library's thread, each in the order it wrote them.
@@ -20,12 +20,18 @@
 #include <thread>
 #include <vector>
 
+#include "byte_order.h"
 #include "daemon_process.h"
-#include "kernel_peer.h"
+#include "kernel_port.h"
 #include "test_env.h"
 #include "tools/sim/simulator.h"
 
 namespace matrix {
+
+using kestrelctl::build_command;
+using kestrelctl::build_frame;
+using kestrelctl::Frame;
+using kestrelctl::KernelPort;
 
 using namespace std::chrono_literals;
 using Lines = std::vector<std::string>;
@@ -112,12 +118,12 @@ inline bool wait_for_tasks(pid_t pid, int n, std::chrono::milliseconds timeout) 
 // frames and the coefficient refresh, which other threads send at any time, left out).
 struct Outcome {
   Lines lines;
-  std::vector<KernelFrame> frames;
+  std::vector<Frame> frames;
 };
 
 inline std::vector<Bytes> raw_frames(const Outcome& o) {
   std::vector<Bytes> out;
-  for (const KernelFrame& f : o.frames) out.push_back(f.raw);
+  for (const Frame& f : o.frames) out.push_back(f.raw);
   return out;
 }
 
@@ -132,7 +138,9 @@ class Rig {
  public:
   // The simulator listens (answering as a healthy phone or only as told) and the kernel's port
   // is bound; the daemon starts with start(), so a case can prepare the simulator first.
-  explicit Rig(bool healthy = true) : sim(test_socket_path(), healthy), kernel(100) {}
+  explicit Rig(bool healthy = true) : sim(test_socket_path(), healthy) {
+    EXPECT_TRUE(kernel.open_bound(100));
+  }
 
   void start(const DaemonEnv& env = {}) {
     daemon = std::make_unique<DaemonProcess>(env, tools.dir());
@@ -145,7 +153,7 @@ class Rig {
     ASSERT_TRUE(daemon->wait_for("main: do while start = 0\n", 10s)) << daemon->output();
     ASSERT_TRUE(sim.wait_for_connection(10s)) << daemon->output();
     ASSERT_TRUE(wait_for_tasks(daemon->pid(), 2, 10s)) << daemon->output();
-    ASSERT_TRUE(kernel.receive_type(34, 10s)) << "the refresh frame of the start-up";
+    ASSERT_TRUE(kernel.next_frame_of_type(34, 10s)) << "the refresh frame of the start-up";
     sync();
   }
 
@@ -162,7 +170,7 @@ class Rig {
     if (!datagram.empty()) {
       EXPECT_TRUE(kernel.send(datagram));
     }
-    EXPECT_TRUE(kernel.send(command_frame(static_cast<uint16_t>(next_marker_++))));
+    EXPECT_TRUE(kernel.send(build_command(static_cast<uint16_t>(next_marker_++))));
     EXPECT_TRUE(daemon->wait_for(marker, 30s)) << daemon->output();
     Outcome out;
     const Lines main = main_lines();
@@ -177,7 +185,7 @@ class Rig {
     }
     main_seen_ = m + 1;
     // The main thread sent its frames before it walked the marker: they are queued already.
-    for (KernelFrame& f : kernel.drain(0ms)) {
+    for (Frame& f : kernel.drain(0ms)) {
       if (is_reply_frame(f.type)) {
         out.frames.push_back(std::move(f));
       } else if (f.type != 2 && f.type != 34) {
@@ -188,14 +196,14 @@ class Rig {
   }
 
   // The next frame of a type that the service callback sends, kept by run() or still to come.
-  std::optional<KernelFrame> callback_frame(uint16_t type, std::chrono::milliseconds timeout) {
+  std::optional<Frame> callback_frame(uint16_t type, std::chrono::milliseconds timeout) {
     for (auto it = late.begin(); it != late.end(); ++it) {
       if (it->type != type) continue;
-      KernelFrame f = std::move(*it);
+      Frame f = std::move(*it);
       late.erase(it);
       return f;
     }
-    return kernel.receive_type(type, timeout);
+    return kernel.next_frame_of_type(type, timeout);
   }
 
   // Waits until n records carry exactly this text (a trailing newline included).
@@ -222,7 +230,8 @@ class Rig {
     Lines texts = thread_texts(all, first == all.end() ? 0 : first->tid);
     Lines out(std::find(texts.begin(), texts.end(), first_text), texts.end());
     for (std::string& l : out) {
-      if (starts_with(l, "BROKEN_PIPE sensor1_handle 0x")) l = "BROKEN_PIPE sensor1_handle <handle>\n";
+      if (starts_with(l, "BROKEN_PIPE sensor1_handle 0x"))
+        l = "BROKEN_PIPE sensor1_handle <handle>\n";
     }
     return out;
   }
@@ -231,10 +240,10 @@ class Rig {
   std::vector<Line> log() const { return parse_log(daemon->output()); }
 
   kestrel_sim::Simulator sim;
-  KernelPeer kernel;
+  KernelPort kernel;
   FakeTools tools;
   std::unique_ptr<DaemonProcess> daemon;
-  std::vector<KernelFrame> late;  // callback frames that run() came across
+  std::vector<Frame> late;  // callback frames that run() came across
 
  private:
   int next_marker_ = 1000;
@@ -242,9 +251,9 @@ class Rig {
 };
 
 // The payload bytes of a frame as signed 32-bit words.
-inline std::vector<int32_t> words_of(const KernelFrame& f) {
+inline std::vector<int32_t> words_of(const Frame& f) {
   std::vector<int32_t> w;
-  for (size_t i = 0; i + 4 <= f.payload.size(); i += 4) w.push_back(f.word(i / 4));
+  for (size_t i = 0; i + 4 <= f.payload.size(); i += 4) w.push_back(load_i32(f.payload.data(), i));
   return w;
 }
 
@@ -269,8 +278,8 @@ inline Bytes frame_bytes(uint16_t type, Bytes body) {
 
 // The self-test reply of the accelerometer from its eight result words.
 inline Bytes accel_reply(const std::vector<int32_t>& w) {
-  return frame_bytes(9, payload({0, w[0], w[4], w[5], w[6], w[7], w[1], w[2], w[3], 0, 0, 0, 0,
-                                 0, 0, 0, 0, 0}));
+  return frame_bytes(
+      9, payload({0, w[0], w[4], w[5], w[6], w[7], w[1], w[2], w[3], 0, 0, 0, 0, 0, 0, 0, 0, 0}));
 }
 
 }  // namespace matrix

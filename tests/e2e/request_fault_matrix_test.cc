@@ -37,9 +37,15 @@ struct Kind {
   std::vector<int32_t> requests_after_write_error = {};
 };
 
-std::string pm(int n) { return "process_message: " + std::to_string(n); }
-std::string alloc(const std::string& name) { return "[" + name + "]sensor1_alloc_msg_buf error - 12\n"; }
-std::string write5(const std::string& name) { return "[" + name + "]sensor1_write -error  5\n"; }
+std::string pm(int n) {
+  return "process_message: " + std::to_string(n);
+}
+std::string alloc(const std::string& name) {
+  return "[" + name + "]sensor1_alloc_msg_buf error - 12\n";
+}
+std::string write5(const std::string& name) {
+  return "[" + name + "]sensor1_write -error  5\n";
+}
 
 std::vector<Kind> kinds() {
   const std::string get_raw12 = "get_raw error get_raw_data returned 12\n";
@@ -51,76 +57,146 @@ std::vector<Kind> kinds() {
                           std::to_string(i == 0 ? 4 : i) + "\n");
   }
   const std::string dump = "process_message: NETLINK_MESSAGE_DUMP_REGISTER - sensor_type (0)";
-  const std::string mag = "get_mag_register_data: sensor_type = 8, pdata_sensor_type:2, id=20, "
-                          "send_to_kernel=1\n";
+  const std::string mag =
+      "get_mag_register_data: sensor_type = 8, pdata_sensor_type:2, id=20, "
+      "send_to_kernel=1\n";
   const std::string store[] = {"store_calib_data: Enter\n", "store_calib_data: sensor_type = 0 \n"};
   const std::string selftest = "get_selftest_result: sensor_type = 0, id = 0\n";
   const std::string lpf = "set_accel_lpf: sensor_type = 12, id = 0\n";
   const std::string lpf_out = "send_accel_lpf_result OUT: test type = 11, lpf_on_off = 1\n";
   return {
-      {"get_status", command_frame(0, {0}), true, {pm(0), alloc("get_status")}, false,
-       {pm(0), write5("get_status"), kClosed}, false},
-      {"get_raw_data, sensor manager", command_frame(1, {0}), false,
-       {pm(1), alloc("get_raw_data")}, false,
-       {pm(1), write5("get_raw_data"), "get_raw_data: sensor_type = 0 txn_id = 2\n"}, false},
-      {"get_raw_data, light sensor", command_frame(1, {4}), false, {pm(1), get_raw12}, false,
+      {"get_status",
+       build_command(0, {0}),
+       true,
+       {pm(0), alloc("get_status")},
+       false,
+       {pm(0), write5("get_status"), kClosed},
+       false},
+      {"get_raw_data, sensor manager",
+       build_command(1, {0}),
+       false,
+       {pm(1), alloc("get_raw_data")},
+       false,
+       {pm(1), write5("get_raw_data"), "get_raw_data: sensor_type = 0 txn_id = 2\n"},
+       false},
+      {"get_raw_data, light sensor",
+       build_command(1, {4}),
+       false,
+       {pm(1), get_raw12},
+       false,
        {pm(1), "get_raw_data sensor_type:4\n", "[DAF][get_raw_data]sensor1_write -error  5 4\n",
-        "get_raw_data: sensor_type = 40 txn_id = 123\n"}, false},
-      {"stop_raw_data, sensor manager", command_frame(3, {0}), false,
-       {pm(3), alloc("stop_raw_data")}, false,
+        "get_raw_data: sensor_type = 40 txn_id = 123\n"},
+       false},
+      {"stop_raw_data, sensor manager",
+       build_command(3, {0}),
+       false,
+       {pm(3), alloc("stop_raw_data")},
+       false,
        {pm(3), "[stop_raw_data]sensor1_write -error  5 0\n",
-        "stop_raw_data: sensor_type = 0 txn_id = 2\n"}, true},
-      {"stop_raw_data, light sensor", command_frame(3, {4}), false, {pm(3), get_raw12}, false,
+        "stop_raw_data: sensor_type = 0 txn_id = 2\n"},
+       true},
+      {"stop_raw_data, light sensor",
+       build_command(3, {4}),
+       false,
+       {pm(3), get_raw12},
+       false,
        {pm(3), "stop_raw_data sensor_type:4\n", "[DAF][stop_raw_data]sensor1_write -error  5 4\n",
-        "stop_raw_data: sensor_type = 40 txn_id = 123\n"}, true},
-      {"store_calib_data", command_frame(6, {0, 1}), true,
-       {pm(6), store[0], store[1], alloc("store_calib_data")}, false,
+        "stop_raw_data: sensor_type = 40 txn_id = 123\n"},
+       true},
+      {"store_calib_data",
+       build_command(6, {0, 1}),
+       true,
+       {pm(6), store[0], store[1], alloc("store_calib_data")},
+       false,
        {pm(6), store[0], store[1], "store_calib_data: CAL(1)",
-        "store_calib_data: SensorID:0, DataType:0", write5("store_calib_data"), kClosed}, false},
-      {"get_selftest_result", command_frame(8, {0}), true,
-       {pm(8), selftest, alloc("get_selftest_result")}, true,
+        "store_calib_data: SensorID:0, DataType:0", write5("store_calib_data"), kClosed},
+       false},
+      {"get_selftest_result",
+       build_command(8, {0}),
+       true,
+       {pm(8), selftest, alloc("get_selftest_result")},
+       true,
        {pm(8), selftest, "get_selftest_result: LSM6DSM ACCEL SELFTEST, TestType = (6)\n",
         "get_selftest_result: msg_hdr.msg_id = 0xd, id = 0\n", write5("get_selftest_result"),
-        kClosed}, true},
+        kClosed},
+       true},
       // The reset goes out while the report body of a magnetometer stream start is held. Its
       // failure closes the connection the body was taken on, so the report is taken anew on a
       // new connection and written there.
       {"reset_mag_cal (after the magnetometer self test; beside a magnetometer stream start)",
-       command_frame(8, {2}), true,
+       build_command(8, {2}),
+       true,
        {pm(8), "get_selftest_result: sensor_type = 2, id = 20\n", alloc("get_selftest_result"),
-        "send_mag_selftest_result: id == SNS_SMGR_ID_MAG_V01", alloc("reset_mag_cal")}, true,
+        "send_mag_selftest_result: id == SNS_SMGR_ID_MAG_V01", alloc("reset_mag_cal")},
+       true,
        {pm(1), "get_raw_data: Reset Mag Cal IN", write5("reset_mag_cal"), kClosed,
         "get_raw_data: Reset Mag Cal OUT", "libsensor1: open -> 0",
         "sensor1_open_or_reopen: sensor1_open success\n", "get_handle_for_sensor: id:2\n",
-        "get_raw_data: sensor_type = 20 txn_id = 2\n"}, false, 2, -1, command_frame(1, {2}), {2}},
-      {"get_mag_register_data", command_frame(11), true,
-       {pm(11), mag, alloc("get_mag_register_data")}, false,
+        "get_raw_data: sensor_type = 20 txn_id = 2\n"},
+       false,
+       2,
+       -1,
+       build_command(1, {2}),
+       {2}},
+      {"get_mag_register_data",
+       build_command(11),
+       true,
+       {pm(11), mag, alloc("get_mag_register_data")},
+       false,
        {pm(11), mag, "get_mag_register_data: MAG Read Fuserom\n",
         "get_mag_register_data: msg_hdr.msg_id = 0xd, id = 20\n", write5("get_mag_register_data"),
-        kClosed}, false},
-      {"set_accel_lpf", command_frame(15), true, {pm(15), lpf, alloc("set_accel_lpf"), lpf_out},
+        kClosed},
+       false},
+      {"set_accel_lpf",
+       build_command(15),
+       true,
+       {pm(15), lpf, alloc("set_accel_lpf"), lpf_out},
        true,
        {pm(15), lpf, "set_accel_lpf: K6DS3 ACCEL LPF ON\n",
         "set_accel_lpf: msg_hdr.msg_id = 0xd, id = 0\n", write5("set_accel_lpf"), kClosed, lpf_out},
        true},
-      {"set_accel_motor", command_frame(17), false,
-       {pm(17), "set_accel_motor sensor1_alloc_msg_buf error:12\n"}, false,
+      {"set_accel_motor",
+       build_command(17),
+       false,
+       {pm(17), "set_accel_motor sensor1_alloc_msg_buf error:12\n"},
+       false,
        {pm(17), "[DAF][set_accel_motor]sensor1_write -error  5 14\n",
-        "set_accel_motor: Send Motor Enabled state done"}, false},
-      {"dump_register", command_frame(19, {0}), false,
-       {pm(19), dump, "dump_register sensor1_alloc_msg_buf error:12\n"}, false,
-       {pm(19), dump, "[DAF][dump_register]sensor1_write error 5\n"}, false, 1, 20},
+        "set_accel_motor: Send Motor Enabled state done"},
+       false},
+      {"dump_register",
+       build_command(19, {0}),
+       false,
+       {pm(19), dump, "dump_register sensor1_alloc_msg_buf error:12\n"},
+       false,
+       {pm(19), dump, "[DAF][dump_register]sensor1_write error 5\n"},
+       false,
+       1,
+       20},
       // sensor_type 4, 4 data bytes 01 02 03 04.
-      {"send_bigdata", command_frame_bytes(28, {4, 0, 0, 0, 4, 0, 0, 0, 1, 2, 3, 4}), false,
-       {pm(28), "send_bigdata sensor1_alloc_msg_buf error:12\n"}, false,
+      {"send_bigdata",
+       build_frame(28, {4, 0, 0, 0, 4, 0, 0, 0, 1, 2, 3, 4}),
+       false,
+       {pm(28), "send_bigdata sensor1_alloc_msg_buf error:12\n"},
+       false,
        {pm(28), "send_bigdata: type:28, id:40", "[DAF][send_bigdata]sensor1_write -error  5 4\n"},
-       false, 1, 30},
-      {"set_hidden_hole_data", command_frame(35, {4, 1, 2, 3, 4, 5, 6, 7, 8, 9}), false,
-       {pm(35), get_raw12}, false,
+       false,
+       1,
+       30},
+      {"set_hidden_hole_data",
+       build_command(35, {4, 1, 2, 3, 4, 5, 6, 7, 8, 9}),
+       false,
+       {pm(35), get_raw12},
+       false,
        hidden_hole + Lines{"[DAF][set_hidden_hole_data]sensor1_write -error  5 4\n",
-                           "set_hidden_hole_data: sensor_type = 40 txn_id = 123\n"}, false},
-      {"get_sensor_state", command_frame(27, {0, 2}), true, {pm(27), alloc("get_sensor_state")},
-       false, {pm(27), write5("get_sensor_state"), kClosed}, false},
+                           "set_hidden_hole_data: sensor_type = 40 txn_id = 123\n"},
+       false},
+      {"get_sensor_state",
+       build_command(27, {0, 2}),
+       true,
+       {pm(27), alloc("get_sensor_state")},
+       false,
+       {pm(27), write5("get_sensor_state"), kClosed},
+       false},
   };
 }
 
@@ -156,7 +232,7 @@ TEST(RequestFaultMatrix, EveryRequestSurvivesAllocationAndWriteFailures) {
   // thread before it writes, and its request goes out there; the last one checks that no request
   // went out that the cases did not expect.
   auto expect_next_request_on = [&](const Lines& lines) {
-    EXPECT_EQ(rig.run(command_frame(27, {0, 2})).lines, lines);
+    EXPECT_EQ(rig.run(build_command(27, {0, 2})).lines, lines);
     const auto next = take_requests(rig.sim, 1);
     ASSERT_EQ(next.size(), 1u);
     EXPECT_EQ(std::get<0>(next[0]), connection);
@@ -168,7 +244,7 @@ TEST(RequestFaultMatrix, EveryRequestSurvivesAllocationAndWriteFailures) {
     const Outcome healthy = rig.run(kind.command);
     const auto sent = take_requests(rig.sim, kind.requests);
     ASSERT_EQ(sent.size(), kind.requests) << rig.daemon->output();
-    std::optional<KernelFrame> answer;
+    std::optional<Frame> answer;
     if (kind.callback_frame >= 0) {
       answer = rig.callback_frame(static_cast<uint16_t>(kind.callback_frame), 5s);
       ASSERT_TRUE(answer);
@@ -247,7 +323,7 @@ TEST(RequestFaultMatrix, AFailedWriteWhoseCloseFailsEndsTheDaemonWithTheCloseRes
     auto walk = std::find(main.begin(), main.end(), expected.front());
     ASSERT_NE(walk, main.end());
     EXPECT_EQ(Lines(walk, main.end()), expected);
-    for (const KernelFrame& f : rig.kernel.drain(0ms)) {
+    for (const Frame& f : rig.kernel.drain(0ms)) {
       EXPECT_FALSE(is_reply_frame(f.type)) << "no reply after the failure, got type " << f.type;
     }
   }

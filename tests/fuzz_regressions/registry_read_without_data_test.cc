@@ -38,7 +38,7 @@ class RegistryReadWithoutDataTest : public DaemonFixture {
     write_file(test_registry_path(), registry);
     log->clear();
     command(4, {sensor_type});
-    std::optional<KernelFrame> f = kernel->receive_type(5, 2000ms);
+    std::optional<Frame> f = kernel->next_frame_of_type(5, 2000ms);
     return f ? f->raw : Bytes{};
   }
 };

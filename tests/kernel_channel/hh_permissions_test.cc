@@ -10,7 +10,7 @@
 #include <vector>
 
 #include "kernel_channel/process_message.h"
-#include "kernel_peer.h"
+#include "kernel_port.h"
 #include "test_env.h"
 
 using ::testing::ElementsAre;
@@ -35,7 +35,7 @@ TEST(HhFilePermissionsTest, RunsTheFourCommandsInOrderBetweenItsLines) {
   setenv("PATH", path.c_str(), 1);
   __android_log_set_logger(recording_logger);
 
-  const std::vector<uint8_t> frame = command_frame(36);
+  const std::vector<uint8_t> frame = kestrelctl::build_command(36);
   std::vector<uint8_t> buffer(1024, 0);
   std::copy(frame.begin(), frame.end(), buffer.begin());
   process_message(buffer.data(), static_cast<int32_t>(frame.size()));

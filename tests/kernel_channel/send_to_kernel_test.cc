@@ -2,15 +2,15 @@
 // block of the frame cannot be allocated.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <stdlib.h>
 #include <linux/netlink.h>
+#include <stdlib.h>
 #include <sys/socket.h>
 #include <sys/uio.h>
 
 #include <atomic>
 
 #include "kernel_channel/netlink_channel.h"
-#include "kernel_peer.h"
+#include "kernel_port.h"
 #include "log_capture.h"
 
 using ::testing::ElementsAre;
@@ -28,13 +28,13 @@ class SendToKernelTest : public ::testing::Test {
   void SetUp() override {
     set_kernel_channel(daemon_channel());
     ASSERT_GE(kernel_channel(), 0);
-    ASSERT_TRUE(kernel.ok());
+    ASSERT_TRUE(kernel.open_bound(100));
     log.clear();
   }
   void TearDown() override { set_netmgr_malloc_for_testing(nullptr); }
 
   LogCapture log;
-  KernelPeer kernel{100};
+  kestrelctl::KernelPort kernel;
 };
 
 TEST_F(SendToKernelTest, FrameLengthIsNlmsgSpaceWithZeroedPadding) {
@@ -46,7 +46,7 @@ TEST_F(SendToKernelTest, FrameLengthIsNlmsgSpaceWithZeroedPadding) {
     std::vector<uint8_t> payload(c.payload);
     for (size_t i = 0; i < payload.size(); ++i) payload[i] = static_cast<uint8_t>(0xA0 + i);
     ASSERT_EQ(send_to_kernel(20, payload.data(), c.payload), 0);
-    auto f = kernel.receive(2000ms);
+    auto f = kernel.next_frame(2000ms);
     ASSERT_TRUE(f) << "payload " << c.payload;
     EXPECT_EQ(f->raw.size(), c.nlmsg_len);
     EXPECT_EQ(f->len, c.nlmsg_len);
@@ -67,7 +67,7 @@ TEST_F(SendToKernelTest, FrameLengthIsNlmsgSpaceWithZeroedPadding) {
 TEST_F(SendToKernelTest, HeaderBytesAreLittleEndianInOrder) {
   const uint8_t payload[2] = {0x04, 0x01};
   send_to_kernel(34, payload, 2);
-  auto f = kernel.receive(2000ms);
+  auto f = kernel.next_frame(2000ms);
   ASSERT_TRUE(f);
   EXPECT_THAT(f->raw, ElementsAre(20, 0, 0, 0, 34, 0, 0, 0, 0, 0, 0, 0, 0x20, 0x4e, 0, 0, 0x04,
                                   0x01, 0, 0));
@@ -108,7 +108,7 @@ TEST_F(SendToKernelTest, EachFailedBlockLogsItsLineFreesTheOthersAndSendsNothing
     EXPECT_THAT(log.messages(), ElementsAre(c.line, "failed on netmgr_nl_alloc_msg\n"));
     for (const LogRecord& r : log.records()) EXPECT_EQ(r.priority, 6);
     EXPECT_EQ(g_calls.load(), c.fail_at) << "allocation stops at the first failure";
-    EXPECT_FALSE(kernel.receive(50ms)) << "nothing is sent";
+    EXPECT_FALSE(kernel.next_frame(50ms)) << "nothing is sent";
   }
 }
 

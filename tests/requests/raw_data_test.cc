@@ -2,6 +2,7 @@
 // driver requests, the stop replies, the magnetometer's once-only steps and the sensitivities its
 // samples are converted with, the write failures after which a stream operation carries on, and
 // a stream of the healthy phone from start to stop.
+#include "byte_order.h"
 #include "request_fixture.h"
 #include "requests/register_access.h"
 
@@ -111,7 +112,7 @@ TEST_F(RawDataTest, MagnetometerResetsItsCalibrationOncePerStreamAndKeepsFuseRom
   }
   EXPECT_THAT(seen, ElementsAre(Pair(38, 20), Pair(2, 1), Pair(13, 0), Pair(2, 1), Pair(2, 2),
                                 Pair(38, 20), Pair(2, 1)));  // reset, start, fuse ROM, ...
-  EXPECT_TRUE(kernel->receive_type(11, 100ms) == std::nullopt);
+  EXPECT_TRUE(kernel->next_frame_of_type(11, 100ms) == std::nullopt);
 }
 
 TEST_F(RawDataTest, WriteFailuresAreLoggedAndTheStopStillReplies) {
@@ -138,16 +139,17 @@ TEST_F(RawDataTest, WriteFailuresAreLoggedAndTheStopStillReplies) {
 TEST_F(RawDataTest, AStreamOfTheHealthyPhoneReachesTheKernelUntilItsStop) {
   sim->set_healthy(true);
   command(1, {0});
-  std::optional<KernelFrame> f = kernel->receive(2000ms);
-  ASSERT_TRUE(f && f->type == 2 && f->len == 32u && f->word(0) == 0) << "no accelerometer sample";
+  std::optional<Frame> f = kernel->next_frame(2000ms);
+  ASSERT_TRUE(f && f->type == 2 && f->len == 32u && load_i32(f->payload.data(), 0) == 0)
+      << "no accelerometer sample";
   command(3, {0});
-  while ((f = kernel->receive(2000ms)) && f->type == 2) {
+  while ((f = kernel->next_frame(2000ms)) && f->type == 2) {
   }
   ASSERT_TRUE(f.has_value());
   EXPECT_EQ(f->raw, word_frame(3, {0, 0}));
   // Samples already on their way may follow the reply, but the stream itself has ended: at
   // 100 Hz, fifty more would take half a second without a pause.
-  for (int late = 0; kernel->receive(300ms); ++late) ASSERT_LT(late, 50) << "the stream runs on";
+  for (int late = 0; kernel->next_frame(300ms); ++late) ASSERT_LT(late, 50) << "the stream runs on";
 }
 
 }  // namespace

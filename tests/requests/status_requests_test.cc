@@ -81,7 +81,7 @@ TEST_F(RequestPatternTest, WriteFailureClosesTheConnectionAndTheNextRequestOpens
 }
 
 TEST(RequestPatternDeathTest, FailingCloseEndsTheProcessWithItsResult) {
-  const Bytes frame = command_frame(0, {1});
+  const Bytes frame = build_command(0, {1});
   expect_exit_on_failing_close([&] { get_status(frame.data()); }, "get_status");
 }
 

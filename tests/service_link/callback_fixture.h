@@ -44,7 +44,7 @@ class CallbackTest : public DaemonFixture {
     return out;
   }
   Bytes payload(uint16_t type) {
-    auto f = kernel->receive_type(type, 5000ms);
+    auto f = kernel->next_frame_of_type(type, 5000ms);
     EXPECT_TRUE(f) << "no frame of type " << type;
     return f ? f->payload : Bytes{};
   }

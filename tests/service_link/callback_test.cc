@@ -83,7 +83,7 @@ TEST_F(CallbackTest, EntryRulesAndResponsesLoggedOrRelayed) {
           Logged{6, "rcv_test_msg: Response: 2, Error: 1"},
           Logged{5, "rcv_test_msg: Received unknown message type: 7"},
           Logged{6, "\n received RETRY_OPEN!!!\n"}));
-  EXPECT_FALSE(kernel->receive(50ms)) << "nothing else goes to the kernel";
+  EXPECT_FALSE(kernel->next_frame(50ms)) << "nothing else goes to the kernel";
 }
 
 TEST_F(CallbackTest, TestIndicationsStoreByIdAndAlwaysRaiseTheWaiter) {
@@ -175,7 +175,7 @@ TEST_F(CallbackTest, ShortBodiesAreRefusedWithOneLine) {
   check(2, 0, 3, 0, resized(sample_indication_body(0, 0, 1, 2, 3), 23), 24);
   check(2, 44, 33, 0, resized(daf_indication_body(61, 1, 24, {}), 31), 32);
   check(2, 44, 33, 0, resized(daf_indication_body(51, 1, 8, {}), 15), 16);
-  EXPECT_FALSE(kernel->receive(50ms)) << "nothing relayed";
+  EXPECT_FALSE(kernel->next_frame(50ms)) << "nothing relayed";
   EXPECT_THAT(factory_state().mag_result, Each(0)) << "nothing stored";
   EXPECT_FALSE(command_waiter_arrived_for_testing()) << "the waiting command sees no response";
 }

@@ -23,8 +23,8 @@ int daemon_channel() {
 
 void DaemonFixture::SetUp() {
   log = std::make_unique<LogCapture>();
-  kernel = std::make_unique<KernelPeer>(100);
-  ASSERT_TRUE(kernel->ok());
+  kernel = std::make_unique<KernelPort>();
+  ASSERT_TRUE(kernel->open_bound(100));
   set_kernel_channel(daemon_channel());
   ASSERT_GE(kernel_channel(), 0);
   sim = std::make_unique<kestrel_sim::Simulator>(test_socket_path(), false);
@@ -59,5 +59,5 @@ void DaemonFixture::dispatch(const std::vector<uint8_t>& datagram) {
 }
 
 void DaemonFixture::command(uint16_t number, const std::vector<int32_t>& words) {
-  dispatch(command_frame(number, words));
+  dispatch(build_command(number, words));
 }

@@ -1,5 +1,5 @@
 // In-process fixture: the daemon's library with its kernel channel on a real netlink socket in
-// this test's private network namespace, the kernel driver played by a KernelPeer, the sensor
+// this test's private network namespace, the kernel driver played by a KernelPort, the sensor
 // processor by an in-process Simulator on the sensor1 socket, and every log record captured.
 // The test's own thread plays the daemon's main thread.
 #pragma once
@@ -9,10 +9,15 @@
 #include <memory>
 #include <vector>
 
-#include "kernel_peer.h"
+#include "kernel_port.h"
 #include "log_capture.h"
 #include "test_env.h"
 #include "tools/sim/simulator.h"
+
+using kestrelctl::build_command;
+using kestrelctl::build_frame;
+using kestrelctl::Frame;
+using kestrelctl::KernelPort;
 
 class DaemonFixture : public ::testing::Test {
  protected:
@@ -28,7 +33,7 @@ class DaemonFixture : public ::testing::Test {
   std::vector<std::string> lines() const { return log->messages(); }
 
   std::unique_ptr<LogCapture> log;
-  std::unique_ptr<KernelPeer> kernel;
+  std::unique_ptr<KernelPort> kernel;
   std::unique_ptr<kestrel_sim::Simulator> sim;
   // Leave false for tests that deliberately leave bodies behind.
   bool check_bodies_released = true;

@@ -160,7 +160,7 @@ class RequestTest : public DaemonFixture {
 
   // The next kernel frame of a type, as its whole raw bytes (empty when none came).
   Bytes frame(uint16_t type) {
-    std::optional<KernelFrame> f = kernel->receive_type(type, 2000ms);
+    std::optional<Frame> f = kernel->next_frame_of_type(type, 2000ms);
     return f ? f->raw : Bytes{};
   }
 

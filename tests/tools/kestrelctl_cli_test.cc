@@ -11,7 +11,7 @@
 
 #include "daemon_frames.h"
 #include "frame_codec.h"
-#include "kernel_peer.h"
+#include "kernel_port.h"
 #include "test_env.h"
 
 namespace kestrelctl {
@@ -40,18 +40,20 @@ std::future<Result> start(const std::string& args) {
 class KestrelctlCli : public testing::Test {
  protected:
   // The next frame kestrelctl sent to the daemon's port.
-  KernelFrame command() { return daemon.receive(std::chrono::seconds(5)).value_or(KernelFrame{}); }
+  Frame command() { return daemon.next_frame(std::chrono::seconds(5)).value_or(Frame{}); }
 
-  KernelPeer daemon{20000};
+  void SetUp() override { ASSERT_TRUE(daemon.open_bound(20000)); }
+
+  KernelPort daemon;
 };
 
 TEST_F(KestrelctlCli, AReplyIsDecodedAndNoReplyIsExitOne) {
   std::future<Result> ctl = start("status light-short --timeout 10");
-  const KernelFrame c = command();
+  const Frame c = command();
   EXPECT_EQ(c.raw, build_command(0, {5}));
-  EXPECT_EQ(c.sender, 100u);                                // it waits on the kernel's port
-  ASSERT_TRUE(daemon.send(daemon_frame(34, {4, 1}), 100));  // not the reply: marked
-  ASSERT_TRUE(daemon.send(daemon_frame(0, {5, 1}), 100));
+  EXPECT_EQ(c.sender, 100u);                                   // it waits on the kernel's port
+  ASSERT_TRUE(daemon.send_to(100, daemon_frame(34, {4, 1})));  // not the reply: marked
+  ASSERT_TRUE(daemon.send_to(100, daemon_frame(0, {5, 1})));
   Result r = ctl.get();
   EXPECT_EQ(r.status, 0);
   EXPECT_EQ(r.out,
@@ -73,7 +75,8 @@ TEST_F(KestrelctlCli, AReplyIsDecodedAndNoReplyIsExitOne) {
 // The frame of each command that only sends (bulk data without its alignment bytes), from
 // a port of its own: the kernel's is left to a listener elsewhere.
 TEST_F(KestrelctlCli, SendOnlyCommandsBuildTheirFrames) {
-  KernelPeer listener(100);  // a `kestrelctl listen` elsewhere
+  KernelPort listener;  // a `kestrelctl listen` elsewhere
+  ASSERT_TRUE(listener.open_bound(100));
   // The arguments, the frame and what the command prints, when checked.
   const std::tuple<std::string, Bytes, std::string> cases[] = {
       // clang-format off
@@ -100,8 +103,8 @@ TEST_F(KestrelctlCli, SendOnlyCommandsBuildTheirFrames) {
 }
 
 TEST(KestrelctlChannel, PortInUseAndNoDaemonAreExitThree) {
-  KernelPeer other(100);
-  ASSERT_TRUE(other.ok());
+  KernelPort other;
+  ASSERT_TRUE(other.open_bound(100));
   Result r = start("status accel --timeout 10").get();
   EXPECT_EQ(r.status, 3);
   EXPECT_EQ(r.err, "kestrelctl: port 100 is in use: is another kestrelctl listening?\n");

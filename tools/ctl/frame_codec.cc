@@ -24,11 +24,19 @@ int hex_digit(char c) {
 
 }  // namespace
 
-std::vector<uint8_t> build_command(uint16_t command, const std::vector<int32_t>& words) {
-  const uint32_t len = kFrameHeaderSize + 4 * static_cast<uint32_t>(words.size());
-  std::vector<uint8_t> f = frame_header(len, command, len);
-  for (size_t i = 0; i < words.size(); ++i) store_i32(f.data(), kFrameHeaderSize + 4 * i, words[i]);
+std::vector<uint8_t> build_frame(uint16_t type, const std::vector<uint8_t>& payload,
+                                 std::optional<uint32_t> nlmsg_len) {
+  const size_t size = kFrameHeaderSize + payload.size();
+  std::vector<uint8_t> f =
+      frame_header(nlmsg_len.value_or(static_cast<uint32_t>(size)), type, size);
+  if (!payload.empty()) memcpy(f.data() + kFrameHeaderSize, payload.data(), payload.size());
   return f;
+}
+
+std::vector<uint8_t> build_command(uint16_t command, const std::vector<int32_t>& words) {
+  std::vector<uint8_t> payload(4 * words.size());
+  for (size_t i = 0; i < words.size(); ++i) store_i32(payload.data(), 4 * i, words[i]);
+  return build_frame(command, payload);
 }
 
 std::vector<uint8_t> build_bigdata(uint16_t command, int32_t sensor_type,
@@ -58,6 +66,7 @@ std::vector<Frame> split_frames(const uint8_t* data, size_t size) {
       if (!frames.empty()) break;
       f.malformed = true;
       f.payload.assign(data + offset, data + size);
+      f.raw = f.payload;
       frames.push_back(f);
       break;
     }
@@ -69,10 +78,12 @@ std::vector<Frame> split_frames(const uint8_t* data, size_t size) {
     if (f.len < kFrameHeaderSize || f.len > left) {
       f.malformed = true;
       f.payload.assign(data + offset, data + size);
+      f.raw = f.payload;
       frames.push_back(f);
       break;
     }
     f.payload.assign(data + offset + kFrameHeaderSize, data + offset + f.len);
+    f.raw.assign(data + offset, data + offset + f.len);
     frames.push_back(f);
     offset += (f.len + 3) & ~3u;
   }

@@ -7,6 +7,7 @@
 #include <stdint.h>
 
 #include <array>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -20,10 +21,17 @@ struct Frame {
   uint32_t seq = 0;
   uint32_t pid = 0;
   std::vector<uint8_t> payload;  // bytes 16 .. nlmsg_len that the datagram holds
+  std::vector<uint8_t> raw;      // the frame's bytes as received, header included
+  uint32_t sender = 0;           // port id the datagram came from (set by KernelPort)
   // nlmsg_len below 16 or beyond the datagram, or a datagram shorter than a header: the payload
   // then holds every byte left, header included.
   bool malformed = false;
 };
+
+// A frame of payload bytes; nlmsg_len is 16 + the payload unless given (frames the driver
+// would never send: nlmsg_len below a header, beyond the datagram, or short of the payload).
+std::vector<uint8_t> build_frame(uint16_t type, const std::vector<uint8_t>& payload,
+                                 std::optional<uint32_t> nlmsg_len = std::nullopt);
 
 // A command frame: nlmsg_len = 16 + 4 x words, type = command, flags, seq and pid 0, then the
 // words as signed 32-bit little-endian values.

@@ -1,10 +1,14 @@
-// The tool's end of the kernel channel: a netlink socket of the host build's protocol that
-// sends command frames to the daemon's port id and, when bound to the kernel's port id,
-// receives the frames the daemon sends to the kernel.
+// The kernel's end of the kernel channel: a netlink socket of the daemon's protocol that sends
+// command frames to the daemon's port id and, when bound to the kernel's port id, receives the
+// frames the daemon sends to the kernel. kestrelctl and the tests both play the kernel through it.
 #pragma once
 
 #include <stdint.h>
 
+#include <chrono>
+#include <deque>
+#include <functional>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -23,24 +27,40 @@ class KernelPort {
   KernelPort(const KernelPort&) = delete;
   KernelPort& operator=(const KernelPort&) = delete;
 
+  // Each call that can fail says why in error, when given.
   // A socket that only sends; the system gives it a port id of its own, so the kernel's port
   // stays free for a listener elsewhere.
-  bool open_unbound(std::string* error);
+  bool open_unbound(std::string* error = nullptr);
   // A socket bound to port, to receive the daemon's frames.
-  bool open_bound(uint32_t port, std::string* error);
+  bool open_bound(uint32_t port, std::string* error = nullptr);
+  int fd() const { return fd_; }
 
-  // One datagram to the daemon's port id 20000.
-  bool send(const std::vector<uint8_t>& datagram, std::string* error);
+  // One datagram to the daemon's port id 20000, or to another port id.
+  bool send(const std::vector<uint8_t>& datagram, std::string* error = nullptr);
+  bool send_to(uint32_t port, const std::vector<uint8_t>& datagram, std::string* error = nullptr);
 
   enum class Wait { kFrames, kTimeout, kInterrupted, kOverrun, kError };
   // Waits up to timeout_ms (negative: without limit) for one datagram and splits it into
-  // frames. kInterrupted when a signal ended the wait; kOverrun when the socket's queue
-  // overflowed and frames were lost (receiving goes on afterwards).
+  // frames (the frames already queued by the calls below come first, without a wait).
+  // kInterrupted when a signal ended the wait; kOverrun when the socket's queue overflowed and
+  // frames were lost (receiving goes on afterwards).
   Wait receive(int timeout_ms, std::vector<Frame>* frames, std::string* error);
+
+  // Frame by frame, over a queue of the frames received and not yet taken: the next frame; the
+  // next frame of one type (frames of other types stay queued, in order); every frame that
+  // comes until none has come for quiet. nullopt or empty when the time ran out.
+  std::optional<Frame> next_frame(std::chrono::milliseconds timeout);
+  std::optional<Frame> next_frame_of_type(uint16_t type, std::chrono::milliseconds timeout);
+  std::vector<Frame> drain(std::chrono::milliseconds quiet);
 
  private:
   bool open_socket(std::string* error);
+  // Waits for one datagram and queues its frames.
+  Wait read_datagram(int timeout_ms, std::string* error);
+  std::optional<Frame> next_matching(const std::function<bool(const Frame&)>& match,
+                                     std::chrono::milliseconds timeout);
   int fd_ = -1;
+  std::deque<Frame> pending_;
 };
 
 }  // namespace kestrelctl
