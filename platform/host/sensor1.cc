@@ -12,6 +12,10 @@
 // held while a callback runs, so a callback may block, open a new connection or close any
 // connection, its own included.
 //
+// Like a phone's client library, sensor1_close does not return while a callback is running on
+// the connection it closes: it waits for that callback to return. A close on the library's own
+// thread (from inside a callback) goes through at once.
+//
 // Handles are never freed: a closed handle stays in the process-wide list, marked closed, so a
 // late call on it gets an error instead of touching freed memory. The file descriptor of a
 // connection is closed only by the library thread (or by the failed open that created it), never
@@ -109,6 +113,7 @@ struct sensor1_handle_s {
 
   // Guarded by g_lock.
   LinkState state = LinkState::kOpen;
+  bool in_callback = false;  // the library thread is inside this connection's callback
   bool fd_to_close = false;  // closed or ended, descriptor still to be closed by the thread
   Fault faults[kOpCount];
 
@@ -120,6 +125,8 @@ namespace {
 
 // Lock order: a handle's io_lock before g_lock.
 pthread_mutex_t g_lock = PTHREAD_MUTEX_INITIALIZER;
+pthread_cond_t g_callback_returned = PTHREAD_COND_INITIALIZER;  // with g_lock
+thread_local bool t_library_thread = false;
 sensor1_handle_s* g_handles = nullptr;  // guarded by g_lock
 pthread_once_t g_thread_once = PTHREAD_ONCE_INIT;
 int g_wake[2] = {-1, -1};  // pipe that wakes the library thread when the set changes
@@ -192,6 +199,18 @@ const char* op_name(uint8_t op) {
   }
 }
 
+// Runs h's callback on the library thread; a close of h waits until it has returned.
+void run_callback(sensor1_handle_s* h, sensor1_msg_header_s* hdr, int type, void* body) {
+  pthread_mutex_lock(&g_lock);
+  h->in_callback = true;
+  pthread_mutex_unlock(&g_lock);
+  h->cb(h->cb_data, hdr, type, body);
+  pthread_mutex_lock(&g_lock);
+  h->in_callback = false;
+  pthread_cond_broadcast(&g_callback_returned);
+  pthread_mutex_unlock(&g_lock);
+}
+
 // Sends one record on h under its io_lock. False when the connection is gone.
 bool send_record(sensor1_handle_s* h, const uint8_t* data, size_t size) {
   pthread_mutex_lock(&h->io_lock);
@@ -215,7 +234,7 @@ void end_connection(sensor1_handle_s* h) {
   __android_log_print(ANDROID_LOG_INFO, kTag, "connection ended, BROKEN_PIPE");
   sensor1_msg_header_s hdr;
   memset(&hdr, 0, sizeof hdr);
-  h->cb(h->cb_data, &hdr, SENSOR1_MSG_TYPE_BROKEN_PIPE, nullptr);
+  run_callback(h, &hdr, SENSOR1_MSG_TYPE_BROKEN_PIPE, nullptr);
 }
 
 bool is_open(sensor1_handle_s* h) {
@@ -272,11 +291,11 @@ bool deliver(sensor1_handle_s* h, const uint8_t* p, size_t size) {
     case kRecResponse:
     case kRecIndication:
       if (!take_message(f, avail, &hdr, &body)) return false;
-      h->cb(h->cb_data, &hdr, kind == kRecResponse ? SENSOR1_MSG_TYPE_RESP : SENSOR1_MSG_TYPE_IND,
-            body);
+      run_callback(h, &hdr, kind == kRecResponse ? SENSOR1_MSG_TYPE_RESP : SENSOR1_MSG_TYPE_IND,
+                   body);
       return true;
     case kRecRetryOpen:
-      h->cb(h->cb_data, &hdr, SENSOR1_MSG_TYPE_RETRY_OPEN, nullptr);
+      run_callback(h, &hdr, SENSOR1_MSG_TYPE_RETRY_OPEN, nullptr);
       return true;
     case kRecCallback: {
       if (avail < 5) return false;
@@ -287,7 +306,7 @@ bool deliver(sensor1_handle_s* h, const uint8_t* p, size_t size) {
         release_body(body);
         body = nullptr;
       }
-      h->cb(h->cb_data, (flags & 1) != 0 ? &hdr : nullptr, type, body);
+      run_callback(h, (flags & 1) != 0 ? &hdr : nullptr, type, body);
       return true;
     }
     case kRecFault:
@@ -350,6 +369,7 @@ void close_retired_descriptors() {
 }
 
 void* library_thread(void*) {
+  t_library_thread = true;
   std::vector<pollfd> fds;
   std::vector<sensor1_handle_s*> polled;
   std::vector<uint8_t> chunk(64 * 1024);
@@ -499,8 +519,13 @@ int sensor1_close(sensor1_handle_s* handle) {
     // The simulator sees the end at once; the descriptor itself is closed by the thread.
     if (handle->fd >= 0) shutdown(handle->fd, SHUT_RDWR);
   }
-  pthread_mutex_unlock(&g_lock);
   pthread_mutex_unlock(&handle->io_lock);
+  // No new callback starts on a closed connection; one already running is waited for, unless
+  // this is that callback's own thread.
+  while (handle->in_callback && !t_library_thread) {
+    pthread_cond_wait(&g_callback_returned, &g_lock);
+  }
+  pthread_mutex_unlock(&g_lock);
   if (closed_now) wake_thread();
   log_line("close -> %d", result);
   return result;

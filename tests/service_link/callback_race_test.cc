@@ -1,13 +1,16 @@
 // The callback on the library's thread against the daemon's others: a broken link torn down and
 // rebuilt (DIAG logging stopped and restarted as the debug level allows, a new coefficient
 // refresh), results handed to a waiting main thread, register dumps kept whole under their lock.
+#include <signal.h>
 #include <stdio.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <thread>
 
 #include "callback_fixture.h"
 #include "diag/diag_logging.h"
+#include "requests/status_requests.h"
 #include "service_link/factory_state.h"
 #include "service_link/response_waiter.h"
 
@@ -121,6 +124,33 @@ TEST_F(CallbackThreadsTest, BrokenLinkWhileACommandWaitsThenResultsReachTheWaiti
     EXPECT_THAT(factory_state().gyro_result, Each(round));
     EXPECT_EQ(test_status(), 0);
   }
+}
+
+// A write fails on the main thread while the callback, on the library's thread, is rebuilding the
+// link (held in its DIAG stop until the main thread is inside sensor1_close, which waits for that
+// callback to return): both go on, and the link is rebuilt. A deadlock ends the process.
+TEST_F(CallbackThreadsTest, WriteFailureWhileTheLinkIsRebuiltDoesNotDeadlock) {
+  signal(SIGALRM, [](int) {
+    if (write(2, "deadlock: close and recovery wait for each other\n", 49) > 0) _exit(3);
+  });
+  alarm(10);
+  get_handle_for_sensor(0);
+  write_file(tools.dir() + "/diag_mdlog", "#!/bin/sh\necho \"diag_mdlog $*\" >> " + tools.dir() +
+                                              "/calls\nwhile [ ! -e " + tools.dir() +
+                                              "/go ]; do sleep 0.01; done\n");
+  set_diag_logging_state(1);
+  ASSERT_TRUE(sim->fault(FaultOp::kWrite, 5, 1));
+  sim->callback(250, true, false, Header{}, {});
+  ASSERT_TRUE(tools.wait_for_calls(1, 5000));
+  std::thread main_thread(get_sensor_state);
+  ASSERT_TRUE(log->wait_for("[get_sensor_state]sensor1_write -error  5\n", 5000ms));
+  std::this_thread::sleep_for(200ms);  // into sensor1_close
+  write_file(tools.dir() + "/go", "");
+  main_thread.join();
+  recovery_lines();
+  alarm(0);
+  EXPECT_EQ(log->count("BROKEN_PIPE success to open sensor1\n"), 1u);
+  EXPECT_EQ(sim->opened_connections(), 2);
 }
 
 TEST_F(CallbackThreadsTest, DumpsFromSeveralThreadsKeepFrameAndLinesTogether) {
