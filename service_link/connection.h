@@ -12,6 +12,11 @@ constexpr int32_t kOpenRetryBudget = 50;
 // allows. sensor_type is only logged. The result may be null.
 sensor1_handle_s* get_handle_for_sensor(int32_t sensor_type);
 
+// The same, for the library's callback thread: an open in progress on another thread is not
+// waited for (the empty handle is returned), so that thread never waits on one that may itself be
+// waiting in sensor1_close for the callback to return.
+sensor1_handle_s* get_handle_without_waiting(int32_t sensor_type);
+
 // The current handle (null when empty), without opening anything.
 sensor1_handle_s* current_sensor1_handle();
 
@@ -19,8 +24,9 @@ sensor1_handle_s* current_sensor1_handle();
 // tests that call rcv_test_msg as the library does.
 intptr_t sensor1_callback_data();
 
-// Closes the current handle (if any) and empties it; used by the broken-pipe recovery and by the
-// closing variant of the request pattern. Returns the close result (0 when there was none).
+// Closes the current handle (if any) and empties it; used by the broken-pipe recovery. A
+// connection being opened at that moment is the broken one: its opener closes it. Returns the
+// close result (0 when there was none).
 int close_sensor1_handle();
 
 // Closes handle and empties the shared one when it is still the current handle; a handle that

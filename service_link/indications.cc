@@ -283,7 +283,7 @@ void handle_broken_pipe() {
   sensor1_handle_s* handle = nullptr;
   for (int i = 0; i < kReopenTries && handle == nullptr; ++i) {
     platform_sleep_seconds(1);
-    handle = get_handle_for_sensor(0);
+    handle = get_handle_without_waiting(0);
   }
   if (handle != nullptr) {
     KLOGE("BROKEN_PIPE success to open sensor1\n");
