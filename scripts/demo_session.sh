@@ -1,10 +1,17 @@
 #!/usr/bin/env bash
-# The demo's session, run inside its own network namespace by scripts/demo.sh.
+# The demo's session, run inside its own network namespace by scripts/demo.sh. What it leaves:
+# the session's capture (every frame both ways), the accelerometer stream as a plot and as CSV,
+# and everything kestrelctl printed, in KESTREL_DEMO_OUT (default: demo/ in the build directory).
 set -uo pipefail
 build=$1
 here=$(cd "$(dirname "$0")/.." && pwd)
 work=$(mktemp -d /tmp/kestrel-demo-XXXXXX)
 scale=${KESTREL_DEMO_TIME_SCALE:-0.25}
+out=${KESTREL_DEMO_OUT:-$build/demo}
+mkdir -p "$out"
+capture=$out/session.pcap
+transcript=$out/session.txt
+rm -f "$capture" "$transcript" "$out/accel.png" "$out/accel.csv"
 
 bold=$(printf '\033[1m'); dim=$(printf '\033[2m'); off=$(printf '\033[0m')
 [ -t 1 ] || { bold=; dim=; off=; }
@@ -28,7 +35,7 @@ export KESTREL_TIME_SCALE=$scale
 export PATH=$work/bin:$PATH
 
 sim=$build/tools/sim/kestrel-sim
-ctl=$build/tools/ctl/kestrelctl
+ctl=("$build/tools/ctl/kestrelctl" --pcap "$capture")
 pids=()
 cleanup() { for p in "${pids[@]}"; do kill "$p" 2>/dev/null; done; wait 2>/dev/null; rm -rf "$work"; }
 trap cleanup EXIT
@@ -61,7 +68,10 @@ passed=0; failed=0
 run() {  # title, kestrelctl arguments...
   local title=$1; shift
   say "$title:  kestrelctl $*"
-  if "$ctl" "$@"; then passed=$((passed + 1)); else failed=$((failed + 1)); echo "  ${bold}FAILED${off}"; fi
+  local status=0
+  "${ctl[@]}" "$@" > "$work/out.txt" || status=$?
+  cat "$work/out.txt"; cat "$work/out.txt" >> "$transcript"
+  if [ $status -eq 0 ]; then passed=$((passed + 1)); else failed=$((failed + 1)); echo "  ${bold}FAILED${off}"; fi
 }
 
 run "Sensor status" status accel
@@ -73,8 +83,8 @@ run "Gyroscope temperature" gyro-temp
 run "Magnetometer fuse ROM" mag fuserom
 run "Magnetometer registers" mag registers
 # A stream prints every sample; the demo shows its start, its end and how many came.
-say "Accelerometer stream, two seconds at 100 Hz:  kestrelctl stream accel --seconds 2"
-if "$ctl" --quiet stream accel --seconds 2 > "$work/stream.txt"; then
+say "Accelerometer stream, two seconds at 100 Hz:  kestrelctl stream accel --seconds 2 --plot accel.png --csv accel.csv"
+if "${ctl[@]}" stream accel --seconds 2 --plot "$out/accel.png" --csv "$out/accel.csv" > "$work/stream.txt"; then
   passed=$((passed + 1))
   samples=$(grep -c "^type 2 " "$work/stream.txt")
   grep -v "^type 2 " "$work/stream.txt" | head -n 1
@@ -85,6 +95,10 @@ if "$ctl" --quiet stream accel --seconds 2 > "$work/stream.txt"; then
 else
   failed=$((failed + 1)); echo "  ${bold}FAILED${off}"
 fi
+cat "$work/stream.txt" >> "$transcript"
+run "Accelerometer low-pass filter" lpf on
+run "Light sensor thresholds (bulk data)" bigdata 28 00
+run "Light sensor hd thresholds (bulk data)" bigdata 31 00
 run "Register dump of the accelerometer" dump 0
 run "Calibration from the registry" calib read accel
 run "Calibration store" calib store accel --flag 0
@@ -96,11 +110,28 @@ wait_log "chown : end" 10 && sed 's/^/  ran: /' "$work/tools.log"
 say "A DIAG dump (command 27, argument 0) restarts logging"
 : > "$work/tools.log"
 # The dump stops the tool, waits 2 s, starts it again and waits 5 s more.
-"$ctl" diag dump >/dev/null && sleep "$(awk "BEGIN { print $scale * 9 }")"
+"${ctl[@]}" diag dump >> "$transcript" && sleep "$(awk "BEGIN { print $scale * 9 }")"
 show_log "diag : |diag_logging_thread|STATE:" | tail -n 12
 sed 's/^/  ran: /' "$work/tools.log" 2>/dev/null
+
+say "The session's capture, as tshark shows it with the dissector:  tshark -X lua_script:tools/wireshark/kestrel.lua -r session.pcap"
+if command -v tshark >/dev/null 2>&1; then
+  tshark -X lua_script:"$here/tools/wireshark/kestrel.lua" -r "$capture" 2>/dev/null |
+    awk -v dim="$dim" -v off="$off" '
+      / type 2 \(sample\)/ { if (samples++ >= 2) { if (samples == 3) print dim "  ..." off; next } }
+      { print "  " $0 }
+      END { print dim "  (" samples - 2 " more samples left out here)" off }'
+
+else
+  echo "  (tshark is not installed)"
+fi
 
 say "Summary"
 echo "  $passed passed, $failed failed"
 echo "  ${dim}full daemon log: $(grep -c '^KESTRELD' "$work/kestreld.log") records${off}"
+echo "  capture:   $capture"
+echo "             $build/tools/ctl/kestrelctl decode $capture"
+echo "             wireshark -X lua_script:$here/tools/wireshark/kestrel.lua $capture"
+echo "  plot:      $out/accel.png  (CSV: $out/accel.csv)"
+echo "  printed:   $transcript"
 [ "$failed" -eq 0 ]

@@ -4,8 +4,10 @@
 #   scripts/deps.sh base|fuzz|soak|arm64
 set -euo pipefail
 
+# libpcap writes and reads kestrelctl's captures, gnuplot draws its plots; tshark (with
+# text2pcap, editcap and mergecap) and jq read the captures in the tests.
 packages=(cmake ninja-build g++ libgtest-dev libgmock-dev libbenchmark-dev android-liblog-dev
-          iproute2 util-linux)
+          iproute2 util-linux libpcap-dev gnuplot-nox tshark jq)
 case "${1:-base}" in
   base) ;;
   fuzz) packages+=(clang libclang-rt-dev) ;;
@@ -15,7 +17,7 @@ case "${1:-base}" in
     # GoogleTest for arm64 from Debian's multiarch, which needs arm64 as a foreign architecture
     # (added here as root; the install below then updates the package lists).
     packages+=(g++-aarch64-linux-gnu qemu-user blueprint-tools android-liblog-dev:arm64
-               libgtest-dev:arm64 libgmock-dev:arm64)
+               libgtest-dev:arm64 libgmock-dev:arm64 libpcap-dev:arm64)
     if command -v dpkg >/dev/null 2>&1 &&
         ! dpkg --print-foreign-architectures | grep -qx arm64; then
       if [ "$(id -u)" -eq 0 ]; then

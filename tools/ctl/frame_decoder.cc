@@ -124,23 +124,17 @@ void decode_sample(const Frame& f, DecodedFrame* d) {
     values.push_back(static_cast<int16_t>(load_u16(f.payload.data(), 4 + 2 * i)));
   }
   add_code(d, "code", code);
+  const SampleScale scale = sample_scale(code);
   std::string text;
   if (code == 0 || code == 1 || code == 2) {
     text = "x=" + std::to_string(values[0]) + " y=" + std::to_string(values[1]) +
-           " z=" + std::to_string(values[2]);
-    // The daemon scales accelerometer samples to 4096 counts per g and magnetometer samples
-    // to 0.15 uT per count.
-    if (code == 0) {
-      text += printf_string(" (%.3f %.3f %.3f g)", values[0] / 4096.0, values[1] / 4096.0,
-                            values[2] / 4096.0);
-    } else if (code == 2) {
-      text += printf_string(" (%.2f %.2f %.2f \u00b5T)", values[0] * 0.15, values[1] * 0.15,
-                            values[2] * 0.15);
-    }
-  } else if (code == 3) {
-    text = joined({values[0], values[1], values[2]});
+           " z=" + std::to_string(values[2]) +
+           printf_string(code == 0 ? " (%.3f %.3f %.3f " : " (%.2f %.2f %.2f ",
+                         values[0] * scale.per_count, values[1] * scale.per_count,
+                         values[2] * scale.per_count) +
+           scale.unit + ")";
   } else {
-    text = joined(values);
+    text = joined(std::vector<int64_t>(values.begin(), values.begin() + scale.axes));
   }
   d->fields.push_back(Field{"values", json_array(values), text});
   d->one_line = true;
@@ -341,27 +335,92 @@ void decode_hh_refresh(const Frame& f, DecodedFrame* d) {
 
 }  // namespace
 
+SampleScale sample_scale(int32_t code) {
+  switch (code) {
+    case 0:
+      return {"acceleration", "g", "g", 1.0 / 4096, 3};
+    case 1:
+      return {"angular rate", "\u00b0/s", "dps", 1.0 / 70, 3};
+    case 2:
+      return {"magnetic field", "\u00b5T", "uT", 0.15, 3};
+    case 3:
+      return {"value", "counts", "counts", 1.0, 3};
+    default:
+      return {"value", "counts", "counts", 1.0, 6};
+  }
+}
+
+std::string axis_name(size_t axes, size_t index) {
+  static const char* const kXyz[3] = {"x", "y", "z"};
+  return axes == 3 && index < 3 ? kXyz[index] : "v" + std::to_string(index);
+}
+
 std::string frame_type_name(uint16_t type) {
   const Layout* l = layout_of(type);
   return l != nullptr ? l->name : "unknown";
 }
 
+namespace {
+
+// A frame whose nlmsg_len does not fit: the reason, and no fields.
+bool decode_malformed(const Frame& frame, DecodedFrame* d) {
+  if (!frame.malformed) return false;
+  d->name = "malformed";
+  if (frame.payload.size() < kFrameHeaderSize) {
+    d->problem = "a datagram of " + std::to_string(frame.payload.size()) +
+                 " bytes is shorter than a frame header";
+  } else if (frame.len < kFrameHeaderSize) {
+    d->problem = "nlmsg_len " + std::to_string(frame.len) + " is shorter than the header";
+  } else {
+    d->problem = "nlmsg_len " + std::to_string(frame.len) + " is beyond the " +
+                 std::to_string(frame.payload.size()) + " bytes left in the datagram";
+  }
+  return true;
+}
+
+}  // namespace
+
+DecodedFrame decode_command(const Frame& frame) {
+  DecodedFrame d;
+  d.frame = frame;
+  d.command = true;
+  d.one_line = true;
+  if (decode_malformed(frame, &d)) return d;
+  d.name = command_name(frame.type);
+  const std::vector<uint8_t>& p = frame.payload;
+  constexpr size_t kDataOffset = kBulkDataOffset - kFrameHeaderSize;
+  if (is_bigdata_command(frame.type) && p.size() >= kDataOffset) {
+    const int32_t sensor_type = load_i32(p.data(), 0);
+    const int32_t length = load_i32(p.data(), 4);
+    d.fields.push_back(number("sensor_type", sensor_type));
+    d.fields.push_back(number("length", length));
+    if (length < 0 || static_cast<size_t>(length) > p.size() - kDataOffset) {
+      d.problem = "a length of " + std::to_string(length) + " is beyond the " +
+                  std::to_string(p.size() - kDataOffset) + " data bytes of the frame";
+      return d;
+    }
+    const uint8_t* data = p.data() + kDataOffset;
+    d.fields.push_back(Field{"data", json_string(to_hex(data, length)), to_hex(data, length, " ")});
+    return d;
+  }
+  std::vector<int64_t> words;
+  for (size_t offset = 0; offset + 4 <= p.size(); offset += 4) {
+    words.push_back(load_i32(p.data(), offset));
+  }
+  Field f{"words", json_array(words), joined(words)};
+  f.in_text = !words.empty();
+  d.fields.push_back(f);
+  return d;
+}
+
+DecodedFrame decode_by_sender(const Frame& frame) {
+  return frame.pid == kDaemonPortId ? decode_frame(frame) : decode_command(frame);
+}
+
 DecodedFrame decode_frame(const Frame& frame) {
   DecodedFrame d;
   d.frame = frame;
-  if (frame.malformed) {
-    d.name = "malformed";
-    if (frame.payload.size() < kFrameHeaderSize) {
-      d.problem = "a datagram of " + std::to_string(frame.payload.size()) +
-                  " bytes is shorter than a frame header";
-    } else if (frame.len < kFrameHeaderSize) {
-      d.problem = "nlmsg_len " + std::to_string(frame.len) + " is shorter than the header";
-    } else {
-      d.problem = "nlmsg_len " + std::to_string(frame.len) + " is beyond the " +
-                  std::to_string(frame.payload.size()) + " bytes left in the datagram";
-    }
-    return d;
-  }
+  if (decode_malformed(frame, &d)) return d;
   d.name = frame_type_name(frame.type);
   const Layout* layout = layout_of(frame.type);
   if (layout == nullptr) return d;
@@ -420,8 +479,9 @@ DecodedFrame decode_frame(const Frame& frame) {
 
 std::string format_text(const DecodedFrame& d, bool unrelated) {
   const Frame& f = d.frame;
-  std::string out = "type " + std::to_string(f.type) + " (" + d.name + ")  len " +
-                    std::to_string(f.len) + "  pid " + std::to_string(f.pid);
+  std::string out = (d.command ? "command " : "type ") + std::to_string(f.type) + " (" + d.name +
+                    ")  len " + std::to_string(f.len);
+  if (!d.command || f.pid != 0) out += "  pid " + std::to_string(f.pid);
   if (f.flags != 0) out += "  flags " + std::to_string(f.flags);
   if (f.seq != 0) out += "  seq " + std::to_string(f.seq);
   if (unrelated) out += "  [unrelated]";
@@ -429,6 +489,7 @@ std::string format_text(const DecodedFrame& d, bool unrelated) {
     for (const Field& field : d.fields) {
       if (field.in_text) out += "  " + field.name + " " + field.text;
     }
+    if (!d.problem.empty()) out += "  problem: " + d.problem;
     return out + "\n";
   }
   out += "\n";
@@ -448,8 +509,9 @@ std::string format_text(const DecodedFrame& d, bool unrelated) {
 
 std::string format_json(const DecodedFrame& d, bool unrelated) {
   const Frame& f = d.frame;
-  std::string out = "{\"type\":" + std::to_string(f.type) + ",\"name\":" + json_string(d.name) +
-                    ",\"len\":" + std::to_string(f.len) + ",\"pid\":" + std::to_string(f.pid);
+  std::string out = (d.command ? "{\"command\":" : "{\"type\":") + std::to_string(f.type) +
+                    ",\"name\":" + json_string(d.name) + ",\"len\":" + std::to_string(f.len) +
+                    ",\"pid\":" + std::to_string(f.pid);
   if (f.flags != 0) out += ",\"flags\":" + std::to_string(f.flags);
   if (f.seq != 0) out += ",\"seq\":" + std::to_string(f.seq);
   out += ",\"fields\":{";

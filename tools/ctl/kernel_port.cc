@@ -8,6 +8,7 @@
 #include <sys/socket.h>
 #include <unistd.h>
 
+#include "capture.h"
 #include "kernel_frame.h"
 #include "kestrel_platform.h"
 
@@ -79,7 +80,14 @@ bool KernelPort::send_to(uint32_t port, const std::vector<uint8_t>& datagram, st
   addr.nl_pid = port;
   const ssize_t n = sendto(fd_, datagram.data(), datagram.size(), 0,
                            reinterpret_cast<struct sockaddr*>(&addr), sizeof addr);
-  if (n == static_cast<ssize_t>(datagram.size())) return true;
+  if (n == static_cast<ssize_t>(datagram.size())) {
+    if (capture_ != nullptr) {
+      struct timeval now;
+      gettimeofday(&now, nullptr);
+      capture_->write(datagram.data(), datagram.size(), true, now);
+    }
+    return true;
+  }
   if (n < 0 && errno == ECONNREFUSED) {
     return fail(error, "nothing listens on netlink port " + std::to_string(port) +
                            ": is kestreld running (in this network namespace)?");
@@ -109,6 +117,8 @@ KernelPort::Wait KernelPort::read_datagram(int timeout_ms, std::string* error) {
     fail(error, std::string("cannot receive frames: ") + strerror(errno));
     return Wait::kError;
   }
+  gettimeofday(&received_at_, nullptr);
+  if (capture_ != nullptr) capture_->write(buf, static_cast<size_t>(n), false, received_at_);
   for (Frame& f : split_frames(buf, static_cast<size_t>(n))) {
     f.sender = from.nl_pid;
     pending_.push_back(std::move(f));

@@ -4,6 +4,7 @@
 #pragma once
 
 #include <stdint.h>
+#include <sys/time.h>
 
 #include <chrono>
 #include <deque>
@@ -15,6 +16,8 @@
 #include "frame_codec.h"
 
 namespace kestrelctl {
+
+class CaptureWriter;
 
 // The port id that plays the kernel: KESTREL_KERNEL_PORT, read as the daemon reads it (100
 // when unset or not a number).
@@ -53,6 +56,11 @@ class KernelPort {
   std::optional<Frame> next_frame_of_type(uint16_t type, std::chrono::milliseconds timeout);
   std::vector<Frame> drain(std::chrono::milliseconds quiet);
 
+  // From now on every datagram sent and received also goes to capture, stamped as it passes.
+  void tap(CaptureWriter* capture) { capture_ = capture; }
+  // The time stamp of the last datagram received.
+  const struct timeval& received_at() const { return received_at_; }
+
  private:
   bool open_socket(std::string* error);
   // Waits for one datagram and queues its frames.
@@ -61,6 +69,8 @@ class KernelPort {
                                      std::chrono::milliseconds timeout);
   int fd_ = -1;
   std::deque<Frame> pending_;
+  CaptureWriter* capture_ = nullptr;
+  struct timeval received_at_ = {};
 };
 
 }  // namespace kestrelctl

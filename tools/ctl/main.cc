@@ -6,6 +6,7 @@
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
+#include <time.h>
 
 #include <algorithm>
 #include <array>
@@ -18,11 +19,13 @@
 #include <vector>
 
 #include "byte_order.h"
+#include "capture.h"
 #include "frame_codec.h"
 #include "frame_decoder.h"
 #include "kernel_frame.h"
 #include "kernel_port.h"
 #include "sensor_names.h"
+#include "stream_plot.h"
 
 namespace kestrelctl {
 namespace {
@@ -31,6 +34,7 @@ constexpr int kExitOk = 0;
 constexpr int kExitNoReply = 1;
 constexpr int kExitUsage = 2;
 constexpr int kExitChannel = 3;
+constexpr int kExitFile = 4;
 
 constexpr double kReplyTimeoutSeconds = 12.0;  // the daemon's 8 s wait, and some slack
 constexpr double kBigdataTimeoutSeconds = 2.0;
@@ -42,13 +46,14 @@ const char kHelp[] =
 daemon (netlink port 20000) and prints, decoded, the frames the daemon sends to the kernel's
 port (KESTREL_KERNEL_PORT, default 100).
 
-Usage: kestrelctl [--json] [--quiet] [--timeout SEC] <command> [arguments]
+Usage: kestrelctl [--json] [--quiet] [--timeout SEC] [--pcap FILE] <command> [arguments]
 
 Commands that wait for their reply (exit status 1 when it does not come in time):
   status <sensor>                 command 0; reply frame 0 (did the sensor answer)
   selftest <sensor>               command 8; reply frame 9 (accel, mag, pressure) or 14 (gyro)
   gyro-temp                       command 10; reply frame 10 (gyroscope temperature, deg C)
-  stream <sensor> [--seconds N]   command 1, then every sample (frame 2) for N seconds
+  stream <sensor> [--seconds N] [--csv FILE] [--plot FILE]
+                                  command 1, then every sample (frame 2) for N seconds
                                   (default 5; Ctrl-C stops early), then command 3 and its
                                   reply frame 3
   mag fuserom|registers           command 11 or 12; reply frame 11 or 12
@@ -76,6 +81,16 @@ in another terminal shows what the daemon answers):
                                   print every frame the daemon sends, until N frames, S
                                   seconds or Ctrl-C
 
+Captures:
+  decode <file> [--csv FILE] [--plot FILE]
+                                  print the protocol 23 frames of a netlink capture (from
+                                  --pcap, or from tcpdump on a phone's nlmon interface), each
+                                  with its time stamp (UTC) and direction, told by the sender's
+                                  port id (20000 is the daemon); packets of other netlink
+                                  protocols are skipped and counted. A capture that ends inside
+                                  a packet, or holds a packet cut short, is exit status 4 after
+                                  the frames before it.
+
 Sensors: accel 0, gyro 1, mag 2, pressure 3, light 4, light-short 5, or any sensor_type
 number (negative allowed; 0x hex too).
 
@@ -86,6 +101,13 @@ Options:
   --quiet        while waiting for a reply, skip the frames that are not the reply (the
                  hidden-hole refresh, frame 34; samples of a stream left running). Without it
                  they are printed, marked [unrelated] ("unrelated":true in JSON).
+  --pcap FILE    write every datagram sent and received, as it passes, to FILE: a pcap
+                 capture of netlink protocol 23 (link type NETLINK, as tcpdump writes on
+                 nlmon) that tshark and Wireshark open (tools/wireshark/ decodes its fields).
+                 An existing capture is appended to, so a session's commands share a file.
+  --csv FILE     the samples of the stream (or of the capture) as CSV: time_s from the first
+                 sample, then one column an axis in physical units (x_g, y_g, z_g)
+  --plot FILE    the same drawn by gnuplot, PNG or SVG by the file's extension
   --timeout SEC  how long to wait for a reply. Default: 12 s (the daemon waits up to 8 s for
                  the sensor service before it replies) times KESTREL_TIME_SCALE, at least
                  1 s; bigdata 2 s times KESTREL_TIME_SCALE, at least 1 s.
@@ -96,11 +118,13 @@ sensor's own result word, which the daemon relays unchanged: 1 is PASS, anything
 (for the magnetometer the daemon writes -1 there when the sensor reports a failed test). A
 reply sent after the daemon's own 8 s wait ran out holds the previous result.
 
-Samples: accelerometer values are also shown in g (4096 counts a g) and magnetometer values
-in microtesla (0.15 uT a count), as the daemon scales them.
+Samples: accelerometer values are also shown in g (4096 counts a g), gyroscope values in
+degrees per second (70 counts a degree per second) and magnetometer values in microtesla
+(0.15 uT a count), as the daemon scales them; other sensors' values stay counts.
 
 Exit status: 0 done (reply received), 1 no reply in time, 2 usage error, 3 the netlink
-channel failed (port taken, no daemon).
+channel failed (port taken, no daemon), 4 a capture, CSV or plot file could not be read or
+written.
 )";
 
 struct UsageError : std::runtime_error {
@@ -115,6 +139,7 @@ struct Options {
   std::optional<double> seconds;
   std::optional<long> count;
   std::optional<int32_t> flag;
+  std::optional<std::string> pcap, csv, plot;
   std::vector<std::string> args;
 };
 
@@ -206,6 +231,15 @@ Options parse_options(int argc, char** argv) {
       int32_t n = 0;
       if (!parse_int32(v, &n) || n <= 0) throw UsageError("--count needs a number above 0");
       o.count = n;
+    } else if (name == "--pcap") {
+      o.pcap = take_value();
+    } else if (name == "--csv") {
+      o.csv = take_value();
+    } else if (name == "--plot") {
+      o.plot = take_value();
+      if (!StreamSamples::is_plot_path(*o.plot)) {
+        throw UsageError("--plot draws a .png or a .svg file, not '" + *o.plot + "'");
+      }
     } else if (name == "--flag") {
       int32_t n = 0;
       if (!parse_int32(take_value(), &n)) throw UsageError("--flag needs a 32-bit number");
@@ -242,6 +276,7 @@ class Ctl {
   int run();
 
  private:
+  int dispatch();
   using Match = std::function<bool(const Frame&)>;
 
   void expect_arguments(size_t count, const char* usage) const;
@@ -268,8 +303,11 @@ class Ctl {
   int bigdata();
   int hh();
   int listen();
+  int decode();
+  int write_samples(const StreamSamples& samples);
 
   Options o_;
+  CaptureWriter capture_;
   KernelPort port_;
 };
 
@@ -287,6 +325,9 @@ void Ctl::only_options(const std::set<std::string>& allowed) const {
   }
   if (o_.flag && allowed.count("--flag") == 0) {
     throw UsageError("--flag does not apply to " + command);
+  }
+  if ((o_.csv || o_.plot) && allowed.count("--csv") == 0) {
+    throw UsageError(std::string(o_.csv ? "--csv" : "--plot") + " does not apply to " + command);
   }
 }
 
@@ -317,34 +358,8 @@ void Ctl::print_sent(const std::vector<uint8_t>& datagram, bool raw) {
                       "\n");
     return;
   }
-  const uint32_t len = load_u32(datagram.data(), kFrameLenOffset);
-  const uint16_t command = load_u16(datagram.data(), kFrameTypeOffset);
-  std::string text = "sent command " + std::to_string(command) + " (" + command_name(command) +
-                     ")  len " + std::to_string(len);
-  std::string json = "{\"sent\":{\"command\":" + std::to_string(command) +
-                     ",\"name\":" + json_string(command_name(command)) +
-                     ",\"len\":" + std::to_string(len);
-  if (is_bigdata_command(command)) {
-    const int32_t sensor_type = load_i32(datagram.data(), kSensorTypeOffset);
-    const int32_t length = load_i32(datagram.data(), kArgumentOffset);
-    const uint8_t* data = datagram.data() + kBulkDataOffset;
-    text += "  sensor_type " + std::to_string(sensor_type) + "  length " + std::to_string(length) +
-            "  data " + to_hex(data, length, " ");
-    json += ",\"sensor_type\":" + std::to_string(sensor_type) +
-            ",\"length\":" + std::to_string(length) +
-            ",\"data\":" + json_string(to_hex(data, length));
-  } else {
-    std::string words_text;
-    std::string words_json;
-    for (size_t offset = kFrameHeaderSize; offset + 4 <= len; offset += 4) {
-      const std::string w = std::to_string(load_i32(datagram.data(), offset));
-      words_text += " " + w;
-      words_json += (words_json.empty() ? "" : ",") + w;
-    }
-    if (!words_text.empty()) text += "  words" + words_text;
-    json += ",\"words\":[" + words_json + "]";
-  }
-  out(o_.json ? json + "}}\n" : text + "\n");
+  const DecodedFrame d = decode_command(split_frames(datagram.data(), datagram.size()).at(0));
+  out(o_.json ? "{\"sent\":" + format_json(d) + "}\n" : "sent " + format_text(d));
 }
 
 double Ctl::reply_timeout(double nominal) const {
@@ -450,14 +465,17 @@ int Ctl::stream() {
   print_sent(start);
 
   auto is_sample = [](const Frame& f) { return !f.malformed && f.type == FRAME_SAMPLE; };
+  StreamSamples samples;
   const Clock::time_point end = after_seconds(seconds);
   while (!g_interrupted && Clock::now() < end) {
     std::vector<Frame> frames;
     const KernelPort::Wait w = port_.receive(milliseconds_until(end), &frames, &error);
     if (w == KernelPort::Wait::kError) return channel_error(error);
     if (w == KernelPort::Wait::kOverrun) note("samples were lost: the receive queue overflowed");
+    const struct timeval& t = port_.received_at();
     for (const Frame& f : frames) {
       if (is_sample(f) || !o_.quiet) print_frame(f, !is_sample(f));
+      if (is_sample(f)) samples.add(f, t.tv_sec + t.tv_usec / 1e6);
     }
   }
   g_interrupted = 0;
@@ -465,8 +483,103 @@ int Ctl::stream() {
   const std::vector<uint8_t> stop = build_command(NETLINK_MESSAGE_STOP_RAW_DATA, {sensor_type});
   if (!port_.send(stop, &error)) return channel_error(error);
   print_sent(stop);
-  return await([](const Frame& f) { return !f.malformed && f.type == FRAME_STOP_RAW_DATA; },
-               is_sample, reply_timeout(kReplyTimeoutSeconds), "frame type 3");
+  // Samples still on their way belong to the stream, in its CSV and plot too (await asks once
+  // a frame whether it is related).
+  auto late_sample = [&](const Frame& f) {
+    if (!is_sample(f)) return false;
+    const struct timeval& t = port_.received_at();
+    samples.add(f, t.tv_sec + t.tv_usec / 1e6);
+    return true;
+  };
+  const int r = await([](const Frame& f) { return !f.malformed && f.type == FRAME_STOP_RAW_DATA; },
+                      late_sample, reply_timeout(kReplyTimeoutSeconds), "frame type 3");
+  const int written = write_samples(samples);
+  return r != kExitOk ? r : written;
+}
+
+int Ctl::write_samples(const StreamSamples& samples) {
+  std::string error;
+  if (samples.others() > 0) {
+    note(std::to_string(samples.others()) +
+         " samples of other sensors are left out of the CSV and the plot");
+  }
+  if (o_.csv && !samples.write_csv(*o_.csv, &error)) {
+    note(error);
+    return kExitFile;
+  }
+  if (o_.plot && !samples.write_plot(*o_.plot, &error)) {
+    note(error);
+    return kExitFile;
+  }
+  return kExitOk;
+}
+
+// The time stamp of a captured datagram, in text (UTC time of day) and in JSON (seconds).
+std::string stamp(const struct timeval& time, bool json) {
+  char buf[64];
+  if (json) {
+    snprintf(buf, sizeof buf, "%lld.%06ld", static_cast<long long>(time.tv_sec),
+             static_cast<long>(time.tv_usec));
+  } else {
+    struct tm t;
+    const time_t seconds = time.tv_sec;
+    gmtime_r(&seconds, &t);
+    snprintf(buf, sizeof buf, "%02d:%02d:%02d.%06ld", t.tm_hour, t.tm_min, t.tm_sec,
+             static_cast<long>(time.tv_usec));
+  }
+  return buf;
+}
+
+int Ctl::decode() {
+  expect_arguments(1, "decode <capture file> [--csv FILE] [--plot FILE]");
+  CaptureReader reader;
+  std::string error;
+  if (!reader.open(o_.args[1], &error)) {
+    note(error);
+    return kExitFile;
+  }
+  StreamSamples samples;
+  uint64_t frames = 0;
+  uint64_t foreign = 0;
+  int status = kExitOk;
+  for (;;) {
+    CapturedPacket p;
+    const CaptureReader::Next next = reader.next(&p, &error);
+    if (next == CaptureReader::Next::kEnd) break;
+    if (next == CaptureReader::Next::kError) {
+      note(error);
+      status = kExitFile;
+      break;
+    }
+    if (p.arphrd != kArphrdNetlink || p.protocol != kCaptureProtocol) {
+      ++foreign;
+      continue;
+    }
+    if (p.datagram.size() < p.original_size) {
+      note("packet " + std::to_string(p.number) +
+           " is cut short: " + std::to_string(p.datagram.size()) + " of its " +
+           std::to_string(p.original_size) + " bytes were captured (capture with tcpdump -s 0)");
+      status = kExitFile;
+      break;
+    }
+    for (const Frame& f : split_frames(p.datagram.data(), p.datagram.size())) {
+      const DecodedFrame d = decode_by_sender(f);
+      const std::string direction = d.command ? "to_daemon" : "from_daemon";
+      if (o_.json) {
+        out("{\"time\":" + stamp(p.time, true) + ",\"direction\":\"" + direction + "\"," +
+            format_json(d).substr(1) + "\n");
+      } else {
+        out(stamp(p.time, false) + (d.command ? " kernel > daemon  " : " daemon > kernel  ") +
+            format_text(d));
+      }
+      if (!d.command) samples.add(f, p.time.tv_sec + p.time.tv_usec / 1e6);
+      ++frames;
+    }
+  }
+  note(std::to_string(frames) + " frames of netlink protocol 23; " + std::to_string(foreign) +
+       " packets of other protocols skipped");
+  const int written = write_samples(samples);
+  return status != kExitOk ? status : written;
 }
 
 int Ctl::dump() {
@@ -571,6 +684,23 @@ int Ctl::listen() {
 }
 
 int Ctl::run() {
+  if (o_.pcap && !o_.help && !o_.args.empty() && o_.args[0] != "decode") {
+    std::string error;
+    if (!capture_.open(*o_.pcap, &error)) {
+      note(error);
+      return kExitFile;
+    }
+    port_.tap(&capture_);
+  }
+  const int status = dispatch();
+  if (!capture_.error().empty()) {
+    note(capture_.error());
+    return status != kExitOk ? status : kExitFile;
+  }
+  return status;
+}
+
+int Ctl::dispatch() {
   if (o_.help || (!o_.args.empty() && o_.args[0] == "help")) {
     out(kHelp);
     return kExitOk;
@@ -592,8 +722,13 @@ int Ctl::run() {
     return listen();
   }
   if (command == "stream") {
-    only_options({"--seconds"});
+    only_options({"--seconds", "--csv"});
     return stream();
+  }
+  if (command == "decode") {
+    only_options({"--csv"});
+    if (o_.pcap) throw UsageError("--pcap does not apply to decode");
+    return decode();
   }
   if (command == "calib") {
     only_options({"--flag"});
