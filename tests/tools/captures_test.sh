@@ -61,7 +61,7 @@ printf '%s\n' "0000 00 04 03 38 00 00 00 00 00 00 00 00 00 00 00 00" \
   "0000 00 04 03 38 00 00 00 00 00 00 00 00 00 00 00 10" \
   "0010 20 00 00 00 02 00 00 00 00 00 00 00 00 00 00 00" \
   "0020 00 00 00 00 01 00 00 00 02 00 00 00 03 00 00 00" > "$out/foreign.txt"
-text2pcap -q -F pcap -l 253 "$out/foreign.txt" "$out/foreign.pcap" >/dev/null
+text2pcap -q -F pcap -l 253 "$out/foreign.txt" "$out/foreign.pcap" 2>/dev/null
 editcap -F pcap -r "$cap" "$out/head.pcap" 1-20 && editcap -F pcap "$cap" "$out/tail.pcap" 1-20
 mergecap -F pcap -a -w "$out/phone.pcap" "$out/head.pcap" "$out/foreign.pcap" "$out/tail.pcap" \
   >/dev/null

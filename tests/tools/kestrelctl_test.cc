@@ -65,6 +65,8 @@ TEST(KestrelctlDecode, EveryFrameTypeReadsAsText) {
       {2, words({0, int32_t(0xf0000800), 0x000901a1, 0x00090009}),
        "type 2 (sample)  len 32  pid 20000  code 0 (accel)  "
        "values x=2048 y=-4096 z=417 (0.500 -1.000 0.102 g)\n"},
+      {2, words({1, int32_t(0xffba0046), 14, 0}), "type 2 (sample)  len 32  pid 20000  code 1 "
+       "(gyro)  values x=70 y=-70 z=14 (1.00 -1.00 0.20 \u00b0/s)\n"},
       {3, words({5, 0}), "type 3 (stop)  len 24  pid 20000\n  code              5 (light)\n"},
       // The magnetometer's words in hex.
       {5, words({2, 0x04030201, -1, 0, 0, 0, 0, 0, 0, 9, 0}),
@@ -146,6 +148,13 @@ TEST(KestrelctlDecode, JsonCarriesHeaderFieldsPayloadAndMarks) {
       format_json(decode(9, words({0, 1, 5, 6, 7, 8, 2, 3, 4, 0, 0, 0, 0, 0, 0, 0, 0, 0}))),
       testing::HasSubstr("\"result\":1,\"verdict\":\"PASS\",\"accel_result\":[1,2,3,4,5,6,7,8]}"));
   EXPECT_EQ(json_string("a\"b\\c\nd\x01"), "\"a\\\"b\\\\c\\nd\\u0001\"");
+  Bytes bigdata = build_bigdata(24, 4, {1, 2});  // captured with a length beyond its data
+  store_i32(bigdata.data(), 20, 9);
+  EXPECT_EQ(
+      format_json(decode_command(split_frames(bigdata.data(), bigdata.size()).at(0))),
+      "{\"command\":24,\"name\":\"bigdata\",\"len\":26,\"pid\":0,\"fields\":{\"sensor_type\":4,"
+      "\"length\":9},\"payload\":\"04000000090000000102\",\"problem\":\"a length of 9 is beyond "
+      "the 2 data bytes of the frame\"}");
 }
 
 TEST(KestrelctlParse, NumbersAndSensors) {

@@ -108,7 +108,7 @@ local function i32(t, name, p, offset, note)
   local v = p(offset, 4):le_int()
   local item = t:add(F[name], p(offset, 4), v)
   if note then item:append_text(" (" .. note .. ")") end
-  return v
+  return v, item
 end
 
 local function sensor(t, p, offset, size, name)
@@ -145,11 +145,21 @@ local function code(t, p, name)
   return c
 end
 
+-- Counts a unit of the accelerometer (g), gyroscope (degrees per second) and magnetometer (uT).
+local SCALES = {[0] = {1 / 4096, "g"}, [1] = {1 / 70, "\194\176/s"}, [2] = {0.15, "\194\181T"}}
+
 decoders[2] = function(t, p)
-  code(t, p, "code")
-  local values = {}
-  for i = 0, 5 do values[#values + 1] = {p(4 + 2 * i, 2), p(4 + 2 * i, 2):le_int()} end
-  list(t, "values", values)
+  local c = code(t, p, "code")
+  local sub = t:add(kestrel, p(4, 12), "values")
+  sub:set_text("values")
+  for i = 0, 5 do
+    local v = p(4 + 2 * i, 2):le_int()
+    local item = sub:add(F.values, p(4 + 2 * i, 2), v)
+    if SCALES[c] and i < 3 then
+      item:append_text(string.format(" (%s %.3f %s)", ({"x", "y", "z"})[i + 1],
+                                     v * SCALES[c][1], SCALES[c][2]))
+    end
+  end
 end
 
 decoders[3] = function(t, p) code(t, p, "code") end
@@ -159,12 +169,23 @@ decoders[5] = function(t, p)
   local w = {}
   for i = 0, 8 do w[#w + 1] = {p(4 + 4 * i, 4), Int64(p(4 + 4 * i, 4):le_uint())} end
   list(t, "words", w)
-  i32(t, "result", p, 40)
+  local c, r = p(0, 4):le_int(), p(40, 4):le_int()
+  local note = nil
+  if r == -1 then
+    note = "no calibration, or a registry error"
+  elseif c == 0 and r == 1 then
+    note = "calibrated"
+  elseif (c == 1 or c == 2 or c == 5) and r == 0 then
+    note = "read"
+  end
+  i32(t, "result", p, 40, note)
 end
 
 decoders[7] = function(t, p)
   code(t, p, "pdata_sensor_type")
-  i32(t, "result", p, 4)
+  local notes = {[0] = "the sensor completed the calibration",
+                 [1] = "no completion within the daemon's wait"}
+  i32(t, "result", p, 4, notes[p(4, 4):le_int()])
 end
 
 decoders[9] = function(t, p)
@@ -189,7 +210,7 @@ decoders[9] = function(t, p)
     list(t, "mag_result", r)
   elseif st == 3 then
     result()
-    i32(t, "pressure_hpa", p, 8)
+    select(2, i32(t, "pressure_hpa", p, 8)):append_text(" hPa")
   else
     local r = {}
     for i = 0, 17 do r[#r + 1] = {p(4 * i, 4), Int64(w[i])} end
@@ -199,7 +220,7 @@ end
 
 decoders[10] = function(t, p)
   i32(t, "code", p, 0, p(0, 4):le_int() == 11 and "temperature" or nil)
-  i32(t, "temperature_c", p, 4)
+  select(2, i32(t, "temperature_c", p, 4)):append_text(" \194\176C")
 end
 
 local function mag(t, p, fuse_rom)
