@@ -1,6 +1,7 @@
 #include "stream_plot.h"
 
 #include <errno.h>
+#include <signal.h>
 #include <stdio.h>
 #include <string.h>
 #include <sys/wait.h>
@@ -123,8 +124,14 @@ bool StreamSamples::write_plot(const std::string& path, std::string* error) cons
     *error = std::string("cannot run gnuplot: ") + strerror(errno);
     return false;
   }
+  // Without gnuplot the shell ends at once: writing to it must not end this process.
+  struct sigaction ignore = {};
+  struct sigaction before = {};
+  ignore.sa_handler = SIG_IGN;
+  sigaction(SIGPIPE, &ignore, &before);
   fputs(script.c_str(), gnuplot);
   const int status = pclose(gnuplot);
+  sigaction(SIGPIPE, &before, nullptr);
   if (status == -1 || !WIFEXITED(status) || WEXITSTATUS(status) != 0) {
     *error = WIFEXITED(status) && WEXITSTATUS(status) == 127
                  ? "cannot run gnuplot: install the gnuplot-nox package"
