@@ -1,6 +1,7 @@
 #include "indications.h"
 
 #include <pthread.h>
+#include <stdio.h>
 
 #include <algorithm>
 
@@ -69,23 +70,22 @@ indication_kind kind_of(const sensor1_msg_header_s& hdr) {
   return indication_kind::other;
 }
 
-// The fixed fields choose the path: a passed test logs 14 words; a failed one reads its error-code
-// flag, and the code when the flag says so. The words stored for the sensor may reach further.
-uint32_t test_indication_size(const uint8_t* body, uint32_t size) {
+// The result word and, on a failure, the error-code flag choose the path and test_status; the
+// words stored for the sensor must all be there. The passed line shows 14 words and the failure
+// line the error code: those are only logged.
+body_need test_indication_size(const uint8_t* body, uint32_t size) {
   constexpr uint32_t kFixed = kTestIndResultOffset + 4;
-  if (size < kFixed) return kFixed;
-  const uint8_t sensor_id = load_u8(body, kTestIndSensorIdOffset);
-  uint32_t needed;
-  if (load_u32(body, kTestIndResultOffset) == 0) {
-    needed = word_offset(kPassedLineWords);
-  } else {
-    if (size < kTestIndErrorValidOffset + 1) return kTestIndErrorValidOffset + 1;
-    needed = load_u8(body, kTestIndErrorValidOffset) == 1 ? kTestIndErrorCodeOffset + 1
-                                                          : kTestIndErrorValidOffset + 1;
+  if (size < kFixed) return {kFixed, kFixed};
+  const bool passed = load_u32(body, kTestIndResultOffset) == 0;
+  uint32_t handled = passed ? kFixed : kTestIndErrorValidOffset + 1;
+  const size_t words = test_word_count(load_u8(body, kTestIndSensorIdOffset));
+  if (words > 0) handled = std::max<uint32_t>(handled, word_offset(words));
+  if (size < handled) return {handled, handled};
+  uint32_t logged = word_offset(kPassedLineWords);
+  if (!passed) {
+    logged = load_u8(body, kTestIndErrorValidOffset) == 1 ? kTestIndErrorCodeOffset + 1 : 0;
   }
-  const size_t words = test_word_count(sensor_id);
-  if (words > 0) needed = std::max<uint32_t>(needed, word_offset(words));
-  return needed;
+  return {handled, std::max(handled, logged)};
 }
 
 // Codes 61 and 51 read their valid flag and length; only valid data of the full length reads its
@@ -109,24 +109,32 @@ void copy_words(const uint8_t* body, int32_t (&words)[N]) {
   for (size_t i = 0; i < N; ++i) words[i] = load_i32(body, word_offset(i));
 }
 
-void handle_test_indication(const uint8_t* body) {
+// The passed line with the words the body holds (all 14 when it is whole).
+void log_passed_line(const uint8_t* body, uint32_t size) {
+  char line[256];
+  int used =
+      snprintf(line, sizeof line, "%s: Registers Received test Passed1: %i", "rcv_test_msg", 0);
+  for (size_t i = 0; i < kPassedLineWords && word_offset(i + 1) <= size; ++i) {
+    used += snprintf(line + used, sizeof line - static_cast<size_t>(used), ", %d",
+                     load_i32(body, word_offset(i)));
+  }
+  KLOGI("%s", line);
+}
+
+void handle_test_indication(const uint8_t* body, uint32_t size) {
   const uint8_t sensor_id = load_u8(body, kTestIndSensorIdOffset);
   const int32_t test_type = load_i32(body, kTestIndTestTypeOffset);
   KLOGI("%s, SensorID:%d, TestType:%d", "rcv_test_msg", sensor_id, test_type);
 
   const bool passed = load_u32(body, kTestIndResultOffset) == 0;
   if (passed) {
-    int32_t w[kPassedLineWords];
-    for (size_t i = 0; i < kPassedLineWords; ++i) w[i] = load_i32(body, word_offset(i));
-    KLOGI(
-        "%s: Registers Received test Passed1: %i, %d, %d, %d, %d, %d, %d, %d, %d, %d, %d, %d, %d, "
-        "%d, %d",
-        "rcv_test_msg", 0, w[0], w[1], w[2], w[3], w[4], w[5], w[6], w[7], w[8], w[9], w[10], w[11],
-        w[12], w[13]);
+    log_passed_line(body, size);
     set_test_status(0);
   } else if (load_u8(body, kTestIndErrorValidOffset) == 1) {
-    KLOGE("%s: Received error in IND message: %i", "rcv_test_msg",
-          load_u8(body, kTestIndErrorCodeOffset));
+    if (size > kTestIndErrorCodeOffset) {
+      KLOGE("%s: Received error in IND message: %i", "rcv_test_msg",
+            load_u8(body, kTestIndErrorCodeOffset));
+    }
     set_test_status(1);
   } else {
     // The requester set -1 before sending; a failure without a code leaves it there.
@@ -239,29 +247,31 @@ void init_indication_lock() {
   pthread_mutex_init(&indication_lock, nullptr);
 }
 
-uint32_t required_indication_size(const sensor1_msg_header_s& hdr, const uint8_t* body,
-                                  uint32_t size) {
+body_need required_indication_size(const sensor1_msg_header_s& hdr, const uint8_t* body,
+                                   uint32_t size) {
   switch (kind_of(hdr)) {
-    case indication_kind::daf:
-      return daf_indication_size(body, size);
+    case indication_kind::daf: {
+      const uint32_t n = daf_indication_size(body, size);
+      return {n, n};
+    }
     case indication_kind::test:
       return test_indication_size(body, size);
     case indication_kind::sample:
       // The three words are read whatever the sensor id, before the conversion picks its row.
-      return kSampleZOffset + 4;
+      return {kSampleZOffset + 4, kSampleZOffset + 4};
     case indication_kind::other:
       break;
   }
-  return 0;
+  return {0, 0};
 }
 
-void handle_indication(const sensor1_msg_header_s& hdr, const uint8_t* body) {
+void handle_indication(const sensor1_msg_header_s& hdr, const uint8_t* body, uint32_t size) {
   switch (kind_of(hdr)) {
     case indication_kind::daf:
       handle_daf_indication(body);
       break;
     case indication_kind::test:
-      handle_test_indication(body);
+      handle_test_indication(body, size);
       break;
     case indication_kind::sample:
       handle_sample_indication(body);

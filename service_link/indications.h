@@ -6,6 +6,7 @@
 #include <stdint.h>
 
 #include "sensor1.h"
+#include "service_link/service_callback.h"
 
 // indication_lock: held while a sample_frame is filled and sent, so frames of type 2 from the
 // sample and the DAF indications never interleave. Statically initialised; main initialises it
@@ -13,14 +14,16 @@
 void init_indication_lock();
 
 // Bytes of body an indication needs on the path its own fields choose: the test indication up to
-// its last word read, 24 for a sample, 32 / 16 for the filled DAF codes 61 / 51, 0 for the ids
-// nothing is read from. size is how many bytes of body exist; a field that chooses the path and
-// lies beyond them makes its own end the answer.
-uint32_t required_indication_size(const sensor1_msg_header_s& hdr, const uint8_t* body,
-                                  uint32_t size);
+// its last stored word to be handled and up to the last word of its passed line to be logged
+// whole, 24 for a sample, 32 / 16 for the filled DAF codes 61 / 51, 0 for the ids nothing is read
+// from. size is how many bytes of body exist; a field that chooses the path and lies beyond them
+// makes its own end the answer.
+body_need required_indication_size(const sensor1_msg_header_s& hdr, const uint8_t* body,
+                                   uint32_t size);
 
-// Message type 2. body holds at least required_indication_size bytes.
-void handle_indication(const sensor1_msg_header_s& hdr, const uint8_t* body);
+// Message type 2. body holds size bytes, at least the handled bytes of required_indication_size;
+// nothing past them is read.
+void handle_indication(const sensor1_msg_header_s& hdr, const uint8_t* body, uint32_t size);
 
 // Message type 250: tears the connection down and rebuilds it, restarts DIAG logging where the
 // debug level allows it and starts a new hh_read_data_thread. Blocks the caller at least 3 s.

@@ -22,38 +22,52 @@ constexpr size_t kRegisterCount = 128;
 // Dumps 4 and 5 hold the upper half of their device's register space.
 constexpr uint8_t kFirstUpperHalfDump = 4;
 
-constexpr uint32_t kStateResponseSize = kStateRecordsOffset + kStateRecordCount * kStateRecordSize;
+// A state record is read up to its byte 13.
+constexpr uint32_t kStateRecordRead = 14;
+constexpr uint32_t state_record_end(size_t i) {
+  return kStateRecordsOffset + i * kStateRecordSize + kStateRecordRead;
+}
 
 bool is_register_dump(uint8_t txn_id) {
   return txn_id >= kTxnRegisterDumpFirst && txn_id <= kTxnRegisterDumpLast;
 }
 
 // Bytes a response needs on its path. The data rows relay their words whatever the result byte
-// says; every other row reads the result byte first, and the error byte when it is not 0.
-uint32_t required_response_size(const sensor1_msg_header_s& hdr, const uint8_t* body,
-                                uint32_t size) {
+// says; every other row chooses its path by the result byte, and only logs the rest.
+body_need required_response_size(const sensor1_msg_header_s& hdr, const uint8_t* body,
+                                 uint32_t size) {
   switch (hdr.msg_id) {
     case kMsgSmgrSensorState:
-      return kStateResponseSize;
+      return {0, state_record_end(kStateRecordCount - 1)};
     case kMsgSmgrCalReset:
-      return kRespErrorOffset + 1;
+      return {0, kRespErrorOffset + 1};
     case kMsgDafRequest:
-      if (hdr.txn_id == kTxnThreshold) return kDafRespLowOffset + 4;
-      if (hdr.txn_id == kTxnHdThreshold) return kDafRespHdLowOffset + 4;
-      if (is_register_dump(hdr.txn_id)) return kDafRespRegistersOffset + kRegisterCount;
+      if (hdr.txn_id == kTxnThreshold) return {kDafRespLowOffset + 4, kDafRespLowOffset + 4};
+      if (hdr.txn_id == kTxnHdThreshold) return {kDafRespHdLowOffset + 4, kDafRespHdLowOffset + 4};
+      if (is_register_dump(hdr.txn_id)) {
+        return {kDafRespRegistersOffset + kRegisterCount, kDafRespRegistersOffset + kRegisterCount};
+      }
       break;
     default:
       break;
   }
-  if (size < kRespResultOffset + 1) return kRespResultOffset + 1;
-  if (load_u8(body, kRespResultOffset) != 0) return kRespErrorOffset + 1;
-  if (hdr.msg_id == kMsgSmgrReport) return kReportRespSensorIdOffset + 1;
-  return kRespResultOffset + 1;
+  constexpr uint32_t kResult = kRespResultOffset + 1;
+  if (size < kResult) return {kResult, kResult};
+  if (load_u8(body, kRespResultOffset) != 0) return {kResult, kRespErrorOffset + 1};
+  if (hdr.msg_id == kMsgSmgrReport) return {kResult, kReportRespSensorIdOffset + 1};
+  return {kResult, kResult};
 }
 
-void log_sensor_states(const uint8_t* body) {
-  for (size_t i = 0; i < kStateRecordCount; ++i) {
-    uint8_t record[kStateRecordSize];
+// "%s: Response: %u, Error: %u", when the body holds the error byte.
+void log_response_error(const uint8_t* body, uint32_t size) {
+  if (size <= kRespErrorOffset) return;
+  KLOGE("%s: Response: %u, Error: %u", "rcv_test_msg", unsigned{load_u8(body, kRespResultOffset)},
+        unsigned{load_u8(body, kRespErrorOffset)});
+}
+
+void log_sensor_states(const uint8_t* body, uint32_t size) {
+  for (size_t i = 0; i < kStateRecordCount && state_record_end(i) <= size; ++i) {
+    uint8_t record[kStateRecordRead];
     memcpy(record, body + kStateRecordsOffset + i * kStateRecordSize, sizeof record);
     if (record[0] == kStateRecordEmpty) continue;
     KLOGI("STATE: Type-%3d %2x%2x%2x%2x %2x%2x", record[0], unsigned{record[1]},
@@ -95,7 +109,7 @@ void relay_register_dump(uint8_t txn_id, const uint8_t* body) {
   pthread_mutex_unlock(&register_dump_lock);
 }
 
-void handle_daf_response(const sensor1_msg_header_s& hdr, const uint8_t* body) {
+void handle_daf_response(const sensor1_msg_header_s& hdr, const uint8_t* body, uint32_t size) {
   if (hdr.txn_id == kTxnThreshold || hdr.txn_id == kTxnHdThreshold) {
     relay_threshold(hdr.txn_id, body);
     return;
@@ -104,10 +118,8 @@ void handle_daf_response(const sensor1_msg_header_s& hdr, const uint8_t* body) {
     relay_register_dump(hdr.txn_id, body);
     return;
   }
-  const uint8_t result = load_u8(body, kRespResultOffset);
-  if (result != 0) {
-    KLOGE("%s: Response: %u, Error: %u", "rcv_test_msg", unsigned{result},
-          unsigned{load_u8(body, kRespErrorOffset)});
+  if (load_u8(body, kRespResultOffset) != 0) {
+    log_response_error(body, size);
   } else if (hdr.service_number != kServiceDaf) {
     KLOGE("%s: service_number:%u", "rcv_test_msg", hdr.service_number);
   }
@@ -120,29 +132,30 @@ void process_smgr_register_read_resp(const sensor1_msg_header_s& hdr) {
   KLOGE("%s: Cannot parse msg id %d", "process_smgr_register_read_resp", hdr.msg_id);
 }
 
-void handle_response(const sensor1_msg_header_s& hdr, const uint8_t* body) {
+void handle_response(const sensor1_msg_header_s& hdr, const uint8_t* body, uint32_t size) {
   switch (hdr.msg_id) {
     case kMsgSmgrSensorState:
-      log_sensor_states(body);
+      log_sensor_states(body, size);
       return;
     case kMsgSmgrCalReset:
-      KLOGI("SNS_SMGR_CAL_RESET_RESP_V01 - %u, %u", unsigned{load_u8(body, kRespResultOffset)},
-            unsigned{load_u8(body, kRespErrorOffset)});
+      if (size > kRespErrorOffset) {
+        KLOGI("SNS_SMGR_CAL_RESET_RESP_V01 - %u, %u", unsigned{load_u8(body, kRespResultOffset)},
+              unsigned{load_u8(body, kRespErrorOffset)});
+      }
       return;
     case kMsgDafRequest:
-      handle_daf_response(hdr, body);
+      handle_daf_response(hdr, body, size);
       return;
     default:
       break;
   }
   const uint8_t result = load_u8(body, kRespResultOffset);
   if (result != 0) {
-    KLOGE("%s: Response: %u, Error: %u", "rcv_test_msg", unsigned{result},
-          unsigned{load_u8(body, kRespErrorOffset)});
+    log_response_error(body, size);
     return;
   }
   if (hdr.service_number == kServiceRegisterRead) process_smgr_register_read_resp(hdr);
-  if (hdr.msg_id == kMsgSmgrReport) {
+  if (hdr.msg_id == kMsgSmgrReport && size > kReportRespSensorIdOffset) {
     KLOGE("SNS_SMGR_REPORT_REQ_V01 - SensorId = %d txn_id = %d Report id=%d status = %d",
           load_u8(body, kReportRespSensorIdOffset), hdr.txn_id, result,
           load_u8(body, kRespErrorOffset));
@@ -156,7 +169,7 @@ void init_callback_locks() {
   pthread_mutex_init(&register_dump_lock, nullptr);
 }
 
-uint32_t required_body_size(int msg_type, const sensor1_msg_header_s& hdr, const void* body) {
+body_need required_body_size(int msg_type, const sensor1_msg_header_s& hdr, const void* body) {
   const uint8_t* bytes = static_cast<const uint8_t*>(body);
   const uint32_t size = body != nullptr ? hdr.msg_size : 0;
   switch (msg_type) {
@@ -165,7 +178,7 @@ uint32_t required_body_size(int msg_type, const sensor1_msg_header_s& hdr, const
     case kMsgTypeIndication:
       return required_indication_size(hdr, bytes, size);
     default:
-      return 0;
+      return {0, 0};
   }
 }
 
@@ -180,18 +193,25 @@ void rcv_test_msg(intptr_t /*cb_data*/, sensor1_msg_header_s* msg_hdr, int msg_t
   const sensor1_msg_header_s hdr = *msg_hdr;
   const uint8_t* body = static_cast<const uint8_t*>(msg);
   const uint32_t size = msg != nullptr ? hdr.msg_size : 0;
-  const uint32_t needed = required_body_size(msg_type, hdr, msg);
+  const body_need need = required_body_size(msg_type, hdr, msg);
 
-  if (size < needed) {
+  // A body without what is stored, relayed or chooses the path is refused; one without only
+  // what is logged is handled, and its lines show what it holds.
+  if (size < need.handled) {
     KLOGE("%s: type %d service %u msg_id %d txn %u: body of %u bytes, needs %u", "rcv_test_msg",
-          msg_type, hdr.service_number, hdr.msg_id, unsigned{hdr.txn_id}, size, needed);
+          msg_type, hdr.service_number, hdr.msg_id, unsigned{hdr.txn_id}, size, need.handled);
   } else {
+    if (size < need.logged) {
+      KLOGE("%s: type %d service %u msg_id %d txn %u: body of %u bytes, its log lines need %u",
+            "rcv_test_msg", msg_type, hdr.service_number, hdr.msg_id, unsigned{hdr.txn_id}, size,
+            need.logged);
+    }
     switch (msg_type) {
       case kMsgTypeResponse:
-        handle_response(hdr, body);
+        handle_response(hdr, body, size);
         break;
       case kMsgTypeIndication:
-        handle_indication(hdr, body);
+        handle_indication(hdr, body, size);
         break;
       case kMsgTypeBrokenPipe:
         handle_broken_pipe();

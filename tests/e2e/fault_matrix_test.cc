@@ -328,7 +328,9 @@ TEST(FaultMatrix, FaultyTrafficFromTheServiceIsLoggedAndPassedOver) {
   rig.sim.respond(Header{0, 11, 0, 6}, kestrel_sim::common_response_body(1, 4));
   expect_logged("rcv_test_msg: Response: 1, Error: 4", 6);
   rig.sim.respond(Header{0, 64, 0, 0}, Bytes(10, 0));
-  expect_logged("rcv_test_msg: type 1 service 0 msg_id 64 txn 0: body of 10 bytes, needs 196", 6);
+  expect_logged(
+      "rcv_test_msg: type 1 service 0 msg_id 64 txn 0: body of 10 bytes, its log lines need 194",
+      6);
 
   // Light-sensor data that is not valid still produces a frame, without new data.
   rig.sim.indicate(Header{44, 33, 0, 0},

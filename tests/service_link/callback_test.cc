@@ -1,11 +1,13 @@
 // The service callback on the test's thread, as the library calls it: the entry and exit rules,
 // each response's lines and frames byte for byte, test results into the store and the waiter,
-// samples and DAF data out as frames of type 2, and bodies shorter than their layout refused.
+// samples and DAF data out as frames of type 2, and bodies shorter than their layout refused or
+// logged as far as they go.
 // The conversion arithmetic itself is tested on its own, in sample_conversion_test.cc.
 #include <stdio.h>
 
 #include <array>
 #include <numeric>
+#include <optional>
 #include <tuple>
 
 #include "callback_fixture.h"
@@ -152,32 +154,57 @@ TEST_F(CallbackTest, SamplesAndDafDataGoOutAsFramesOfTypeTwo) {
                                     Logged{6, "[DAF]msgPtr->IndicationMsg_valid false"}));
 }
 
-TEST_F(CallbackTest, ShortBodiesAreRefusedWithOneLine) {
+TEST_F(CallbackTest, ShortBodiesRefusedOrLoggedAsFarAsTheyGo) {
+  // Refused when what is stored, relayed or chooses the path is missing; otherwise handled, with
+  // one line first when what its lines show is missing (handled is then what they are).
   auto check = [&](int type, uint32_t service, int32_t msg_id, uint8_t txn, const Bytes& body,
-                   unsigned needed) {
+                   unsigned needed, std::optional<std::vector<Logged>> handled = std::nullopt) {
     deliver(type, service, msg_id, txn, body);
     char line[128];
     snprintf(line, sizeof line,
-             "rcv_test_msg: type %d service %u msg_id %d txn %u: body of %zu bytes, needs %u", type,
-             service, msg_id, unsigned{txn}, body.size(), needed);
-    EXPECT_THAT(logged(), ElementsAre(Logged{6, line}));
+             "rcv_test_msg: type %d service %u msg_id %d txn %u: body of %zu bytes, %s %u", type,
+             service, msg_id, unsigned{txn}, body.size(), handled ? "its log lines need" : "needs",
+             needed);
+    std::vector<Logged> lines = handled.value_or(std::vector<Logged>{});
+    if (body.size() < needed) lines.insert(lines.begin(), Logged{6, line});
+    EXPECT_THAT(logged(), ElementsAreArray(lines));
   };
   check(1, 44, 32, 171, Bytes(139, 0), 140);
   check(1, 44, 32, 168, Bytes(27, 0), 28);
-  deliver(1, 0, 64, 0, Bytes(195, 0));
-  EXPECT_EQ(logged().at(0).second,
-            "rcv_test_msg: type 1 service 0 msg_id 64 txn 0: body of 195 bytes, needs 196");
-  check(1, 0, 2, 2, Bytes(8, 0), 9);
   check(1, 0, 11, 6, {}, 1);
-  check(2, 0, 13, 0, resized(test_indication_body(0, 6, 0, 0, 0, {}), 75), 76);
+  check(2, 0, 13, 0, resized(test_indication_body(0, 6, 0, 0, 0, {}), 51), 52);
+  check(2, 0, 13, 0, resized(test_indication_body(10, 6, 0, 0, 0, {}), 67), 68);
   check(2, 0, 13, 0, resized(test_indication_body(20, 10, 5, 1, 3, {}), 83), 84);
-  check(2, 0, 13, 0, resized(test_indication_body(50, 10, 5, 1, 3, {}), 13), 14);
+  check(2, 0, 13, 0, resized(test_indication_body(30, 6, 0, 0, 0, {}), 27), 28);
   check(2, 0, 3, 0, resized(sample_indication_body(0, 0, 1, 2, 3), 23), 24);
   check(2, 44, 33, 0, resized(daf_indication_body(61, 1, 24, {}), 31), 32);
   check(2, 44, 33, 0, resized(daf_indication_body(51, 1, 8, {}), 15), 16);
   EXPECT_FALSE(kernel->next_frame(50ms)) << "nothing relayed";
   EXPECT_THAT(factory_state().mag_result, Each(0)) << "nothing stored";
   EXPECT_FALSE(command_waiter_arrived_for_testing()) << "the waiting command sees no response";
+
+  Bytes states(194, 255);
+  states[4 + 16 * 10] = 1;
+  states[4 + 16 * 11] = 2;
+  const Logged state10 = {4, "STATE: Type-  1 ffffffff ffff"};
+  check(1, 0, 64, 0, resized(states, 193), 194, {{state10}});
+  check(1, 0, 64, 0, states, 194, {{state10, {4, "STATE: Type-  2 ffffffff ffff"}}});
+  check(1, 0, 2, 2, Bytes(8, 0), 9, {{}});
+  const std::string passed = "rcv_test_msg: Registers Received test Passed1: 0, 1, 2";
+  check(2, 0, 13, 0, resized(test_indication_body(30, 6, 0, 0, 0, {1, 2}), 28), 76,
+        {{{4, "rcv_test_msg, SensorID:30, TestType:6"},
+          {4, passed},
+          {4, "rcv_complete: result - 0\n"}}});
+  check(2, 0, 13, 0, resized(test_indication_body(0, 6, 0, 0, 0, count_from(1, 8)), 52), 76,
+        {{{4, "rcv_test_msg, SensorID:0, TestType:6"},
+          {4, passed + ", 3, 4, 5, 6, 7, 8"},
+          {4, "rcv_complete: result - 0\n"}}});
+  EXPECT_THAT(factory_state().pressure_result, ElementsAre(1, 2));
+  EXPECT_THAT(factory_state().accel_result, ElementsAreArray(count_from(1, 8)));
+  check(2, 0, 13, 0, resized(test_indication_body(50, 10, 5, 1, 3, {}), 13), 14,
+        {{{4, "rcv_test_msg, SensorID:50, TestType:10"},
+          {6, "rcv_test_msg: wrong SensorID 50"},
+          {4, "rcv_complete: result - 1\n"}}});
 }
 
 }  // namespace
