@@ -1,6 +1,5 @@
 // Command 6 against the simulated sensor manager: the single-sensor test request byte for byte,
-// the completion that the sensor manager sends back (or does not), the type-7 reply, and the
-// write failures of the closing variant, down to the exit of the process.
+// the completion that the sensor manager sends back (or does not), and the type-7 reply.
 #include "calibration/calibration_store.h"
 #include "request_fixture.h"
 #include "service_link/factory_state.h"
@@ -60,27 +59,6 @@ TEST_F(CalibrationStoreTest, CompletionBeforeTheWaitAndNoCompletionAtAll) {
   EXPECT_EQ(frame(7), word_frame(7, {2, 1}));
   EXPECT_THAT(lines(), Contains("store_calib_data: ERROR: No response for command"));
   EXPECT_EQ(test_status(), -1);
-}
-
-TEST_F(CalibrationStoreTest, FailedWriteClosesTheConnectionAndSendsNoReply) {
-  ASSERT_NE(get_handle_for_sensor(0), nullptr);
-  ASSERT_TRUE(sim->fault(FaultOp::kWrite, 5, 1));
-  command(6, {4, 1});
-  EXPECT_EQ(main_lines().back(), "[store_calib_data]sensor1_write -error  5\n");  // and no wait
-  ASSERT_TRUE(sim->wait_for_disconnect(2000ms));
-
-  // The next command opens a new connection, and its reply is the first frame to come.
-  answer_tests();
-  command(6, {2, 0});
-  EXPECT_EQ(next().connection, 2);
-  const std::optional<Frame> f = kernel->next_frame(4000ms);
-  ASSERT_TRUE(f.has_value());
-  EXPECT_EQ(f->raw, word_frame(7, {2, 0}));
-}
-
-TEST(CalibrationStoreDeathTest, FailedCloseAfterAFailedWriteEndsTheProcess) {
-  const Bytes frame = build_command(6, {0, 0});
-  expect_exit_on_failing_close([&] { store_calib_data(frame.data()); }, "store_calib_data");
 }
 
 }  // namespace

@@ -1,6 +1,5 @@
 // Commands 35 and 22..32 against the simulated sensor processor: each request as it arrives,
-// header and all 288 body bytes, the log lines around it, the refused data lengths, and the
-// failures of allocation and write through the library's fault knobs.
+// header and all 288 body bytes, the log lines around it, and the refused data lengths.
 #include "request_fixture.h"
 
 namespace request_test {
@@ -92,43 +91,6 @@ TEST_F(HiddenHoleTest, LengthsTheRequestCannotHoldAreRefusedWithOneLine) {
   EXPECT_THAT(main_lines(), ElementsAreArray(expected));
   // The first request to arrive is the second frame's.
   EXPECT_THAT(next(), light_request(123, 100004, {0xaa, 0xbb}));
-}
-
-TEST_F(HiddenHoleTest, FailuresOfAllocationAndWriteLogTheirLineAndCloseNothing) {
-  ASSERT_NE(get_handle_for_sensor(4), nullptr);
-  const std::vector<int32_t> w = {5, 10, 20, 30, 40, 50, 60, 70, 80, 90};
-  const Bytes coefficients = words({10, 20, 30, 40, 50, 60, 70, 80, 90});
-
-  // 11 counts as sent: the request arrives and no error is logged.
-  ASSERT_TRUE(sim->fault(FaultOp::kWrite, 11, 1));
-  command(35, w);
-  EXPECT_THAT(next(), light_request(123, 100010, coefficients));
-  EXPECT_THAT(last_lines(2), ElementsAre("set_hidden_hole_data th_low:90\n",
-                                         "set_hidden_hole_data: sensor_type = 40 txn_id = 123\n"));
-  // Any other result: the error line, and the closing line all the same.
-  ASSERT_TRUE(sim->fault(FaultOp::kWrite, 5, 1));
-  command(35, w);
-  EXPECT_THAT(last_lines(2), ElementsAre("[DAF][set_hidden_hole_data]sensor1_write -error  5 5\n",
-                                         "set_hidden_hole_data: sensor_type = 40 txn_id = 123\n"));
-  ASSERT_TRUE(sim->fault(FaultOp::kWrite, 5, 1));
-  dispatch(bigdata(24, 2, {1, 2}));
-  EXPECT_EQ(lines().back(), "[DAF][send_bigdata]sensor1_write -error  5 4\n");
-
-  // An allocation failure logs its line only.
-  ASSERT_TRUE(sim->fault(FaultOp::kAlloc, 12, 1));
-  log->clear();
-  command(35, w);
-  ASSERT_TRUE(sim->fault(FaultOp::kAlloc, 12, 1));
-  dispatch(bigdata(28, 1, {7}));
-  EXPECT_THAT(main_lines(),
-              ElementsAre("process_message: 35", "get_raw error get_raw_data returned 12\n",
-                          "process_message: 28", "send_bigdata sensor1_alloc_msg_buf error:12\n"));
-
-  // Nothing went out for the failures, and the connection is still the first one.
-  dispatch(bigdata(29, 1, {8}));
-  const Request r = next();
-  EXPECT_EQ(r.connection, 1);
-  EXPECT_THAT(r, light_request(167, 100007, {8}));
 }
 
 }  // namespace

@@ -1,7 +1,6 @@
 // Raw-data streams: the sensor manager's report request byte for byte, the light sensor's
 // driver requests, the stop replies, the magnetometer's once-only steps and the sensitivities its
-// samples are converted with, the write failures after which a stream operation carries on, and
-// a stream of the healthy phone from start to stop.
+// samples are converted with, and a stream of the healthy phone from start to stop.
 #include "byte_order.h"
 #include "request_fixture.h"
 #include "requests/register_access.h"
@@ -113,27 +112,6 @@ TEST_F(RawDataTest, MagnetometerResetsItsCalibrationOncePerStreamAndKeepsFuseRom
   EXPECT_THAT(seen, ElementsAre(Pair(38, 20), Pair(2, 1), Pair(13, 0), Pair(2, 1), Pair(2, 2),
                                 Pair(38, 20), Pair(2, 1)));  // reset, start, fuse ROM, ...
   EXPECT_TRUE(kernel->next_frame_of_type(11, 100ms) == std::nullopt);
-}
-
-TEST_F(RawDataTest, WriteFailuresAreLoggedAndTheStopStillReplies) {
-  const std::tuple<uint16_t, int32_t, const char*> cases[] = {
-      {1, 0, "[get_raw_data]sensor1_write -error  -3\n"},
-      {3, 2, "[stop_raw_data]sensor1_write -error  -3 2\n"},
-      {1, 5, "[DAF][get_raw_data]sensor1_write -error  -3 5\n"},
-      {3, 4, "[DAF][stop_raw_data]sensor1_write -error  -3 4\n"},
-  };
-  command(3, {0});  // opens the connection
-  next();
-  frame(3);
-  for (const auto& [number, sensor_type, line] : cases) {
-    ASSERT_TRUE(sim->fault(FaultOp::kWrite, -3, 1));
-    command(number, {sensor_type});
-    EXPECT_EQ(last_lines(2).front(), line);
-  }
-  EXPECT_EQ(frame(3), word_frame(3, {2, 0}));
-  EXPECT_EQ(frame(3), word_frame(3, {5, 0}));
-  EXPECT_EQ(sim->requests().size(), 1u);    // none of the failed writes went out
-  EXPECT_EQ(sim->opened_connections(), 1);  // the stream operations never close
 }
 
 TEST_F(RawDataTest, AStreamOfTheHealthyPhoneReachesTheKernelUntilItsStop) {

@@ -32,13 +32,20 @@ namespace {
 
 int priority_of(char p) {
   switch (p) {
-    case 'V': return 2;
-    case 'D': return 3;
-    case 'I': return 4;
-    case 'W': return 5;
-    case 'E': return 6;
-    case 'F': return 7;
-    default: return 0;
+    case 'V':
+      return 2;
+    case 'D':
+      return 3;
+    case 'I':
+      return 4;
+    case 'W':
+      return 5;
+    case 'E':
+      return 6;
+    case 'F':
+      return 7;
+    default:
+      return 0;
   }
 }
 
@@ -68,13 +75,13 @@ bool parse_record(const std::string& line, LogRecord* record) {
   record->tag = tag;
   record->priority = priority_of(prio[0]);
   record->message = pos < line.size() ? line.substr(pos + 1) : "";
+  record->tid = atol(tid.c_str());
   return true;
 }
 
 }  // namespace
 
-DaemonProcess::DaemonProcess(const DaemonEnv& env,
-                             const std::string& path_prepend)
+DaemonProcess::DaemonProcess(const DaemonEnv& env, const std::string& path_prepend)
     : state_(new State) {
   int fds[2];
   if (pipe2(fds, O_CLOEXEC) != 0) abort();
@@ -173,9 +180,8 @@ bool DaemonProcess::wait_for(const std::string& message, std::chrono::millisecon
     size_t seen = 0;
     for (const LogRecord& r : state_->records) {
       if (r.tag != tag) continue;
-      if (r.message == message ||
-          (!message.empty() && message.back() == '\n' &&
-           r.message == message.substr(0, message.size() - 1))) {
+      if (r.message == message || (!message.empty() && message.back() == '\n' &&
+                                   r.message == message.substr(0, message.size() - 1))) {
         ++seen;
       }
     }

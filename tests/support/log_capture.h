@@ -9,6 +9,7 @@ struct LogRecord {
   int priority;  // 4 info, 5 warning, 6 error
   std::string tag;
   std::string message;
+  long tid = 0;  // the writing thread, for a daemon run as a process
 };
 
 // One at a time per process. Records of every thread are kept in order of logging.

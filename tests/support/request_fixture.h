@@ -34,6 +34,11 @@ using ::testing::ElementsAreArray;
 using Bytes = std::vector<uint8_t>;
 using Lines = std::vector<std::string>;
 
+inline Lines operator+(Lines a, const Lines& b) {
+  a.insert(a.end(), b.begin(), b.end());
+  return a;
+}
+
 template <typename T>
 void put(Bytes& b, size_t offset, T v) {
   memcpy(b.data() + offset, &v, sizeof v);

@@ -1,4 +1,4 @@
-// Frames as kestreld sends them to the kernel, for the tests of kestrelctl.
+// Frames as kestreld sends them to the kernel, built byte by byte for the tests to compare.
 #pragma once
 
 #include <stdint.h>
@@ -25,4 +25,10 @@ inline Bytes daemon_frame(uint16_t type, const Bytes& payload) {
   store_u32(f.data(), 12, 20000);
   if (!payload.empty()) memcpy(f.data() + 16, payload.data(), payload.size());
   return f;
+}
+
+// The frame whose payload is the words w, padded with zero words to n.
+inline Bytes word_frame(uint16_t type, std::vector<int32_t> w, size_t n = 0) {
+  if (w.size() < n) w.resize(n, 0);
+  return daemon_frame(type, words(w));
 }
