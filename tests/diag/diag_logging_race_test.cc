@@ -5,7 +5,6 @@
 
 #include <thread>
 
-#include "daemon_process.h"
 #include "diag_fixture.h"
 
 namespace {

@@ -1,6 +1,8 @@
 // DIAG logging control inside one process: whether logging may start, the start thread, and
 // command 27 with the dump thread it starts.
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/un.h>
 #include <unistd.h>
 
 #include <optional>
@@ -15,7 +17,7 @@ namespace {
 TEST_F(DiagTest, UsbConfigAndUartFileDecideWhetherLoggingStarts) {
   struct Case {
     const char* q_config;
-    const char* uart;  // null: no file; "/": a directory in its place
+    const char* uart;  // null: no file; "/": a directory in its place; "=": a socket
     Lines expected;
   };
   const Lines diag_mode = {"I check_property is Diag Mode\n",
@@ -28,6 +30,7 @@ TEST_F(DiagTest, UsbConfigAndUartFileDecideWhetherLoggingStarts) {
       {"mtp,adb", "CP\n",
        Lines{"I check_property Success\n", "I check_files is Diag Mode CP\n"} + dm},
       {"mtp,adb", "/", Lines{"I check_property Success\n", "E check_files read fails"} + dm},
+      {"mtp,adb", "=", Lines{"I check_property Success\n", "E check_files open error 6"} + dm},
       // Only the first two bytes count.
       {"", "APCP", Lines{"I check_property Success\n", "I check_files is AP Mode AP\n"} + kStarted},
       {"", "", Lines{"I check_property Success\n", "I check_files is AP Mode \n"} + kStarted},
@@ -42,6 +45,13 @@ TEST_F(DiagTest, UsbConfigAndUartFileDecideWhetherLoggingStarts) {
     remove_file(uart_path());
     if (c.uart != nullptr && std::string(c.uart) == "/") {
       ASSERT_EQ(mkdir(uart_path().c_str(), 0755), 0);
+    } else if (c.uart != nullptr && std::string(c.uart) == "=") {
+      const int s = socket(AF_UNIX, SOCK_STREAM, 0);  // opening it fails with ENXIO
+      struct sockaddr_un addr = {};
+      addr.sun_family = AF_UNIX;
+      snprintf(addr.sun_path, sizeof addr.sun_path, "%s", uart_path().c_str());
+      ASSERT_EQ(bind(s, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr), 0);
+      close(s);
     } else if (c.uart != nullptr) {
       write_file(uart_path(), c.uart);
     }

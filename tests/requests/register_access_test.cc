@@ -33,8 +33,10 @@ TEST_F(RegisterAccessTest, MagnetometerReadsReplyWithTheTestStatusAsResult) {
 
   // A register read that failed with an error code: result 1, the low byte of each word.
   answer_tests(20, 10, {0x1ff, -2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 0x100}, 3);
+  log->clear();
   command(12);
   EXPECT_EQ(next().body, test_request(20, 10, 0, 0));
+  EXPECT_EQ(main_lines().at(2), "get_mag_register_data: MAG Read Registers\n");
   const Bytes registers = {0xff, 0xfe, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 0};
   EXPECT_EQ(frame(12), expected_frame(12, mag_reply({0, 0, 0}, registers, 1)));
 
@@ -52,6 +54,20 @@ TEST_F(RegisterAccessTest, FilterResultFollowsTheReportedTestType) {
   EXPECT_EQ(next().body, test_request(0, 11, 1, 1));
   EXPECT_EQ(frame(16), expected_frame(16, words({13, 0, 1})));
   EXPECT_EQ(main_lines().back(), "send_accel_lpf_result OUT: test type = 12, lpf_on_off = 1\n");
+
+  // Command 16 asks for the filter off (code 13, TestType 12); a reported type 11 sends frame 15.
+  answer_tests(0, 12, {11, 0});
+  log->clear();
+  command(16);
+  EXPECT_EQ(next().body, test_request(0, 12, 1, 1));
+  EXPECT_EQ(frame(15), expected_frame(15, words({12, 0, 0})));
+  EXPECT_THAT(
+      main_lines(),
+      ElementsAre("process_message: 16", "set_accel_lpf: sensor_type = 13, id = 0\n",
+                  "set_accel_lpf: K6DS3 ACCEL LPF OFF\n",
+                  "set_accel_lpf: msg_hdr.msg_id = 0xd, id = 0\n",
+                  "waiting for response IN - timeout=8000", "wait_for_response: response received.",
+                  "send_accel_lpf_result OUT: test type = 11, lpf_on_off = 0\n"));
 
   // An unknown code still sends the request, with TestType left zero.
   log->clear();
@@ -89,24 +105,35 @@ TEST_F(RegisterAccessTest, RegisterDumpRequests) {
                   "sensor1_open_or_reopen: sensor1_open success\n", "get_handle_for_sensor: id:1\n",
                   "[getUUID] sensor_type error (1)\n", "dump_register: send DAF message to slpi"));
   EXPECT_THAT(next(), IsRequest(44, 32, 170, daf_request({}, 100015, {})));
-  for (const auto& [sensor_type, suid] : {std::pair{2, kMagSuid}, std::pair{5, kLightSuid}}) {
+  for (const auto& [sensor_type, suid] : {std::pair{0, kAccelSuid},
+                                          {2, kMagSuid},
+                                          {3, kPressureSuid},
+                                          {4, kLightSuid},
+                                          {5, kLightSuid}}) {
     command(19, {sensor_type});
     EXPECT_THAT(next(), IsRequest(44, 32, 169 + sensor_type, daf_request(suid, 100015, {})));
   }
 
-  // Past 5 nothing is written: the dispatcher stops 6, dump_register stops the rest.
+  // Past 5 nothing is written: the dispatcher stops 6, dump_register the rest (after getUUID,
+  // which knows 6, 7, 14 and 15).
   log->clear();
   command(19, {6});
   command(19, {-1});
-  dump_register(6);
-  EXPECT_THAT(main_lines(),
-              ElementsAre("process_message: 19",
-                          "process_message: NETLINK_MESSAGE_DUMP_REGISTER - sensor_type error",
-                          "process_message: 19",
-                          "process_message: NETLINK_MESSAGE_DUMP_REGISTER - sensor_type (-1)",
-                          "[getUUID] sensor_type error (-1)\n",
-                          "[DAF][dump_register] sensor_type error -1\n",
-                          "[DAF][dump_register] sensor_type error 6\n"));
+  Lines expected = {"process_message: 19",
+                    "process_message: NETLINK_MESSAGE_DUMP_REGISTER - sensor_type error",
+                    "process_message: 19",
+                    "process_message: NETLINK_MESSAGE_DUMP_REGISTER - sensor_type (-1)",
+                    "[getUUID] sensor_type error (-1)\n",
+                    "[DAF][dump_register] sensor_type error -1\n"};
+  for (uint32_t sensor_type : {6, 7, 8, 14, 15, 16}) {
+    dump_register(sensor_type);
+    const std::string n = std::to_string(sensor_type);
+    if (sensor_type == 8 || sensor_type == 16) {
+      expected.push_back("[getUUID] sensor_type error (" + n + ")\n");
+    }
+    expected.push_back("[DAF][dump_register] sensor_type error " + n + "\n");
+  }
+  EXPECT_EQ(main_lines(), expected);
   command(19, {0});
   EXPECT_EQ(next().header.txn_id, 169);  // the first request after the refused ones
 }

@@ -214,13 +214,3 @@ void DaemonProcess::kill_now() {
   ::kill(pid_, SIGKILL);
   wait_exit(std::chrono::milliseconds(5000));
 }
-
-double test_time_scale() {
-  const char* v = getenv("KESTREL_TIME_SCALE");
-  return v != nullptr ? atof(v) : 1.0;
-}
-
-std::chrono::milliseconds scaled(std::chrono::milliseconds nominal) {
-  return std::chrono::milliseconds(
-      static_cast<long>(static_cast<double>(nominal.count()) * test_time_scale()));
-}

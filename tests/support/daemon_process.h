@@ -20,8 +20,7 @@ class DaemonProcess {
  public:
   // Starts the daemon with the test's environment plus env (a value of "" unsets a variable).
   // path_prepend goes before PATH (the recording stand-ins of shell tools).
-  explicit DaemonProcess(const DaemonEnv& env = {},
-                         const std::string& path_prepend = "");
+  explicit DaemonProcess(const DaemonEnv& env = {}, const std::string& path_prepend = "");
   ~DaemonProcess();  // kills the daemon if it still runs
   DaemonProcess(const DaemonProcess&) = delete;
   DaemonProcess& operator=(const DaemonProcess&) = delete;
@@ -45,7 +44,3 @@ class DaemonProcess {
   State* state_;
   pid_t pid_ = -1;
 };
-
-// Time scale the end-to-end tests run the daemon at, and a nominal duration at that scale.
-double test_time_scale();
-std::chrono::milliseconds scaled(std::chrono::milliseconds nominal);

@@ -19,25 +19,40 @@ void make_dirs(const std::string& path) {
 
 }  // namespace
 
-std::string test_socket_path() { return getenv("KESTREL_SENSOR1_SOCKET"); }
-std::string test_properties_path() { return getenv("KESTREL_PROPERTIES"); }
-std::string test_registry_path() { return getenv("KESTREL_SENSOR_REG"); }
-std::string test_sysroot() { return getenv("KESTREL_SYSROOT"); }
+std::string test_socket_path() {
+  return getenv("KESTREL_SENSOR1_SOCKET");
+}
+std::string test_properties_path() {
+  return getenv("KESTREL_PROPERTIES");
+}
+std::string test_registry_path() {
+  return getenv("KESTREL_SENSOR_REG");
+}
+std::string test_sysroot() {
+  return getenv("KESTREL_SYSROOT");
+}
+
+std::chrono::milliseconds scaled(std::chrono::milliseconds nominal) {
+  return std::chrono::milliseconds(
+      static_cast<long>(static_cast<double>(nominal.count()) * atof(getenv("KESTREL_TIME_SCALE"))));
+}
 
 void write_file(const std::string& path, const std::string& text) {
   make_dirs(path);
   std::ofstream(path, std::ios::trunc) << text;
 }
 
-void remove_file(const std::string& path) { unlink(path.c_str()); }
+void remove_file(const std::string& path) {
+  unlink(path.c_str());
+}
 
 FakeTools::FakeTools() {
   char tmpl[] = "/tmp/kestrel-tools-XXXXXX";
   dir_ = mkdtemp(tmpl);
   for (const char* tool : {"chown", "chmod", "diag_mdlog"}) {
     const std::string path = dir_ + "/" + tool;
-    write_file(path, "#!/bin/sh\necho \"" + std::string(tool) + " $*\" >> \"" + dir_ +
-                         "/calls\"\n");
+    write_file(path,
+               "#!/bin/sh\necho \"" + std::string(tool) + " $*\" >> \"" + dir_ + "/calls\"\n");
     chmod(path.c_str(), 0755);
   }
 }

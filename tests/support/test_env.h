@@ -5,6 +5,7 @@
 //   KESTREL_TIME_SCALE 0.05 unless the test's command line environment sets it.
 #pragma once
 
+#include <chrono>
 #include <string>
 #include <vector>
 
@@ -12,6 +13,9 @@ std::string test_socket_path();
 std::string test_properties_path();
 std::string test_registry_path();
 std::string test_sysroot();
+
+// A nominal duration at the time scale the tests run the daemon at (KESTREL_TIME_SCALE).
+std::chrono::milliseconds scaled(std::chrono::milliseconds nominal);
 
 // Writes a whole file (the parent directories are created).
 void write_file(const std::string& path, const std::string& text);
