@@ -70,22 +70,23 @@ TEST_F(SelftestTest, RepliesAreBuiltFromTheWordsOfTheIndication) {
   EXPECT_EQ(next().header.msg_id, 13);
   EXPECT_THAT(next(), IsRequest(0, 38, 4, Bytes({0, 20, 0})));
 
-  // Pressure word 2 is word 1 × 0.01, truncated toward zero.
-  for (const auto& [pressure, hpa] : {std::pair{101325, 1013}, std::pair{-150, -1}}) {
-    answer_tests(30, 6, {7, pressure});
+  // Pressure word 2 is word 1 × 0.01, truncated toward zero; a failed test's words count too.
+  for (const auto& [word0, pressure, hpa, error] :
+       {std::tuple{7, 101325, 1013, -1}, {7, -150, -1, -1}, {9, 500, 5, 2}}) {
+    answer_tests(30, 6, {word0, pressure}, error);
     command(8, {3});
-    EXPECT_EQ(frame(9), word_frame(9, {3, 7, hpa}, 18));
+    EXPECT_EQ(frame(9), word_frame(9, {3, word0, hpa}, 18));
   }
 
   // Gyroscope: g2..g4 divide toward zero; g9 - g6 overflows 32 bits, and so does its negation.
-  answer_tests(10, 6, {1, 100, -1999, 1999, 0, 55, -2, 40, 50, INT_MAX, 30, -50});
+  answer_tests(10, 6, {1, 100, -1999, 1999, 2000, 55, -2, 40, 50, INT_MAX, 30, -50});
   command(8, {1});
   EXPECT_EQ(
       frame(14),
-      word_frame(14, {1, 100, 55, -1, 1, 0, -2, 40, 50, INT_MAX, 30, -50, INT_MAX, 10, 100}, 15));
+      word_frame(14, {1, 100, 55, -1, 1, 2, -2, 40, 50, INT_MAX, 30, -50, INT_MAX, 10, 100}, 15));
   EXPECT_THAT(last_lines(2),
               ElementsAre("send_gyro_selftest_result: test type 1\n",
-                          "send_gyro_selftest_result: 100, -1999, 1999, 0, 55, -2, 40, 50, "
+                          "send_gyro_selftest_result: 100, -1999, 1999, 2000, 55, -2, 40, 50, "
                           "2147483647, 30, -50\n"));
   // The temperature: -1.5 × 65536 truncates to -1.
   answer_tests(10, 13, {2, -98304, 7});

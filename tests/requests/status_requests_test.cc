@@ -21,8 +21,7 @@ TEST_F(StatusTest, StatusReplyTellsWhetherATestIndicationWasHandedOver) {
   // With an indication: {st, 0}. Out of the table: SensorID 0xFF, and the reply carries the low
   // byte of the sensor_type.
   answer_tests(30, 3, {}, -1, 11);
-  for (const auto& [sensor_type, id] :
-       {std::pair{3, 30}, std::pair{16, 0xff}, std::pair{-1, 0xff}}) {
+  for (const auto& [sensor_type, id] : {std::pair{3, 30}, {15, 0}, {16, 0xff}, {-1, 0xff}}) {
     command(0, {sensor_type});
     EXPECT_EQ(next().body, Bytes({static_cast<uint8_t>(id), 0, 0}));
     EXPECT_EQ(frame(0), expected_frame(0, {static_cast<uint8_t>(sensor_type), 0}));
