@@ -121,25 +121,4 @@ TEST_F(DiagTest, DumpStopsAndRestartsLogging) {
   EXPECT_EQ(tools.calls(), (Lines{kStop, kStart}));
 }
 
-TEST_F(DiagTest, Command27WhileLoggingRunsOrWithArgument2OnlyLogsAndAsksForSensorStates) {
-  for (const auto& [state, argument, expected] :
-       {std::tuple{3, 0,
-                   Lines{"I process_message: 27", "I diag : debugging_mode 3\n",
-                         "I diag : Logging System is running\n"}},
-        std::tuple{1, 2, Lines{"I process_message: 27"}}}) {
-    set_diag_logging_state(state);
-    log->clear();
-    command(27, {0, argument});
-    EXPECT_EQ(view(log->records(), {"diag", "process_message: 27", "process_message: logging",
-                                    "check_", "sns_set_diag"}),
-              expected);
-    EXPECT_EQ(diag_logging_state(), state);
-    EXPECT_TRUE(tools.calls().empty());
-    const std::optional<kestrel_sim::Request> request = sim->next_request(2000ms);
-    ASSERT_TRUE(request.has_value());
-    EXPECT_EQ(request->header.service, 0u);
-    EXPECT_EQ(request->header.msg_id, 64);
-  }
-}
-
 }  // namespace

@@ -301,10 +301,6 @@ TEST(DaemonProcessTest, TheReceiveLoopWalksEachDatagramByTheNetlinkRules) {
        walked(20, {pm(19),
                    "process_message: NETLINK_MESSAGE_DUMP_REGISTER refused: frame of 17 "
                    "bytes, needs 20"})},
-      {build_command(22, {4, 300}),
-       walked(24, {pm(22),
-                   "send_bigdata: command 22 refused: data length 300 (frame carries 0 "
-                   "bytes, at most 256)"})},
       {build_command(19, {6}),
        walked(20, {pm(19), "process_message: NETLINK_MESSAGE_DUMP_REGISTER - sensor_type error"})},
   };
@@ -335,26 +331,6 @@ Lines opens_only(const Lines& lines) {
     }
   }
   return out;
-}
-
-TEST(DaemonProcessTest, AServiceThatRefusesEveryOpenCostsFiftyAttemptsThenNothing) {
-  Rig rig;
-  rig.sim.refuse_opens(11, 50);
-  rig.start();
-  ASSERT_TRUE(rig.daemon->wait_for(would_block(1), 10s)) << rig.daemon->output();
-  // Both start-up threads end; without a connection the sensor1 library has no thread either.
-  ASSERT_TRUE(wait_for_tasks(rig.daemon->pid(), 1, 10s));
-  rig.run({});
-  EXPECT_EQ(opens_only(rig.thread_lines_from("diag_logging_start_thread start\n")),
-            fifty_refused_opens());
-  // The budget is spent: requests fail at their allocation without a new attempt; what needs
-  // no sensor service is still served.
-  EXPECT_EQ(rig.run(build_command(0, {0})),
-            (walked(20, {pm(0), "[get_status]sensor1_alloc_msg_buf error - 22\n"})));
-  rig.run(build_command(4, {3}));
-  EXPECT_EQ(rig.kernel->next_frame_of_type(5, 5s).value_or(Frame{}).raw,
-            word_frame(5, {3, 0, 0, 0, 0, 0, 0, 0, 0, 0, -1}));
-  EXPECT_EQ(rig.sim.opened_connections(), 0);
 }
 
 TEST(DaemonProcessTest, ABrokenLinkWithTheServiceGoneMakesThreeReopenTries) {

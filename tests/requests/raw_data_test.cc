@@ -85,7 +85,7 @@ TEST_F(RawDataTest, MagnetometerResetsItsCalibrationOncePerStreamAndKeepsFuseRom
     const int16_t v[6] = {v0, v1, v2};
     Bytes p = words({2});
     p.insert(p.end(), reinterpret_cast<const uint8_t*>(v), reinterpret_cast<const uint8_t*>(v + 6));
-    EXPECT_EQ(frame(2), expected_frame(2, p));
+    EXPECT_EQ(frame(2), daemon_frame(2, p));
   };
   command(1, {2});
   EXPECT_THAT(last_lines(3),

@@ -19,7 +19,7 @@ TEST_F(RegisterAccessTest, MagnetometerReadsReplyWithTheTestStatusAsResult) {
   answer_tests(20, 9, {64, -128, 0, 7});
   command(11);
   EXPECT_THAT(next(), IsRequest(0, 13, 4, test_request(20, 9, 0, 0)));
-  EXPECT_EQ(frame(11), expected_frame(11, mag_reply({64, -128, 0}, {}, 0)));
+  EXPECT_EQ(frame(11), daemon_frame(11, mag_reply({64, -128, 0}, {}, 0)));
   EXPECT_THAT(
       main_lines(),
       ElementsAre("process_message: 11",
@@ -38,13 +38,13 @@ TEST_F(RegisterAccessTest, MagnetometerReadsReplyWithTheTestStatusAsResult) {
   EXPECT_EQ(next().body, test_request(20, 10, 0, 0));
   EXPECT_EQ(main_lines().at(2), "get_mag_register_data: MAG Read Registers\n");
   const Bytes registers = {0xff, 0xfe, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 0};
-  EXPECT_EQ(frame(12), expected_frame(12, mag_reply({0, 0, 0}, registers, 1)));
+  EXPECT_EQ(frame(12), daemon_frame(12, mag_reply({0, 0, 0}, registers, 1)));
 
   // No answer: the same words, and -1 as the result.
   sim->set_request_hook(nullptr);
   command(12);
   next();
-  EXPECT_EQ(frame(12), expected_frame(12, mag_reply({0, 0, 0}, registers, -1)));
+  EXPECT_EQ(frame(12), daemon_frame(12, mag_reply({0, 0, 0}, registers, -1)));
 }
 
 TEST_F(RegisterAccessTest, FilterResultFollowsTheReportedTestType) {
@@ -52,7 +52,7 @@ TEST_F(RegisterAccessTest, FilterResultFollowsTheReportedTestType) {
   answer_tests(0, 11, {12, 1});
   command(15);
   EXPECT_EQ(next().body, test_request(0, 11, 1, 1));
-  EXPECT_EQ(frame(16), expected_frame(16, words({13, 0, 1})));
+  EXPECT_EQ(frame(16), daemon_frame(16, words({13, 0, 1})));
   EXPECT_EQ(main_lines().back(), "send_accel_lpf_result OUT: test type = 12, lpf_on_off = 1\n");
 
   // Command 16 asks for the filter off (code 13, TestType 12); a reported type 11 sends frame 15.
@@ -60,7 +60,7 @@ TEST_F(RegisterAccessTest, FilterResultFollowsTheReportedTestType) {
   log->clear();
   command(16);
   EXPECT_EQ(next().body, test_request(0, 12, 1, 1));
-  EXPECT_EQ(frame(15), expected_frame(15, words({12, 0, 0})));
+  EXPECT_EQ(frame(15), daemon_frame(15, words({12, 0, 0})));
   EXPECT_THAT(
       main_lines(),
       ElementsAre("process_message: 16", "set_accel_lpf: sensor_type = 13, id = 0\n",

@@ -14,7 +14,7 @@ TEST_F(StatusTest, StatusReplyTellsWhetherATestIndicationWasHandedOver) {
   });
   command(0, {3});
   EXPECT_THAT(next(), IsRequest(0, 11, 6, Bytes({30, 0, 0})));
-  EXPECT_EQ(frame(0), expected_frame(0, {3, 1}));
+  EXPECT_EQ(frame(0), daemon_frame(0, {3, 1}));
   EXPECT_THAT(last_lines(2), ElementsAre("wait_for_response: response received.",
                                          "get_status: ERROR: No response for command"));
 
@@ -24,7 +24,7 @@ TEST_F(StatusTest, StatusReplyTellsWhetherATestIndicationWasHandedOver) {
   for (const auto& [sensor_type, id] : {std::pair{3, 30}, {15, 0}, {16, 0xff}, {-1, 0xff}}) {
     command(0, {sensor_type});
     EXPECT_EQ(next().body, Bytes({static_cast<uint8_t>(id), 0, 0}));
-    EXPECT_EQ(frame(0), expected_frame(0, {static_cast<uint8_t>(sensor_type), 0}));
+    EXPECT_EQ(frame(0), daemon_frame(0, {static_cast<uint8_t>(sensor_type), 0}));
   }
 
   // The logging command asks for the sensor states, even with an action that changes nothing.

@@ -162,15 +162,6 @@ std::vector<std::string> DaemonProcess::messages(const std::string& tag) const {
   return out;
 }
 
-size_t DaemonProcess::count(const std::string& message, const std::string& tag) const {
-  size_t n = 0;
-  std::lock_guard<std::mutex> lock(state_->mutex);
-  for (const LogRecord& r : state_->records) {
-    if (r.tag == tag && r.message == message) ++n;
-  }
-  return n;
-}
-
 bool DaemonProcess::wait_for(const std::string& message, std::chrono::milliseconds timeout,
                              size_t n, const std::string& tag) const {
   // A message ending in "\n" is only complete once the empty line after it has arrived, which

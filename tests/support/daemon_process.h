@@ -29,7 +29,6 @@ class DaemonProcess {
 
   std::vector<LogRecord> records() const;
   std::vector<std::string> messages(const std::string& tag = "KESTRELD") const;
-  size_t count(const std::string& message, const std::string& tag = "KESTRELD") const;
   bool wait_for(const std::string& message, std::chrono::milliseconds timeout, size_t n = 1,
                 const std::string& tag = "KESTRELD") const;
   // Everything the daemon wrote to stderr, for failure messages.

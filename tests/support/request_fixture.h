@@ -13,6 +13,7 @@
 #include <vector>
 
 #include "daemon_fixture.h"
+#include "daemon_frames.h"
 #include "service_link/connection.h"
 
 namespace kestrel_sim {
@@ -31,7 +32,6 @@ using kestrel_sim::Request;
 using kestrel_sim::Simulator;
 using ::testing::ElementsAre;
 using ::testing::ElementsAreArray;
-using Bytes = std::vector<uint8_t>;
 using Lines = std::vector<std::string>;
 
 inline Lines operator+(Lines a, const Lines& b) {
@@ -42,13 +42,6 @@ inline Lines operator+(Lines a, const Lines& b) {
 template <typename T>
 void put(Bytes& b, size_t offset, T v) {
   memcpy(b.data() + offset, &v, sizeof v);
-}
-
-// Little-endian 32-bit words.
-inline Bytes words(const std::vector<int32_t>& w) {
-  Bytes b(w.size() * 4);
-  for (size_t i = 0; i < w.size(); ++i) put(b, 4 * i, w[i]);
-  return b;
 }
 
 // A single-sensor test request body: SensorID, TestType and the four option bytes.
@@ -77,23 +70,6 @@ inline Bytes daf_request(const Bytes& suid, uint32_t request_id, const Bytes& da
   put(b, 24, static_cast<uint32_t>(data.size()));
   std::copy(data.begin(), data.end(), b.begin() + 28);
   return b;
-}
-
-// Raw bytes of an outbound frame of type with payload (alignment included in nlmsg_len).
-inline Bytes expected_frame(uint16_t type, const Bytes& payload) {
-  const uint32_t len = (static_cast<uint32_t>(payload.size()) + 19) & ~3u;
-  Bytes f(len, 0);
-  put(f, 0, len);
-  put(f, 4, type);
-  put(f, 12, 20000u);
-  std::copy(payload.begin(), payload.end(), f.begin() + 16);
-  return f;
-}
-
-// The frame of type whose payload is the words w, padded with zero words to n.
-inline Bytes word_frame(uint16_t type, std::vector<int32_t> w, size_t n = 0) {
-  if (w.size() < n) w.resize(n, 0);
-  return expected_frame(type, words(w));
 }
 
 // A request with its header and its whole body.
