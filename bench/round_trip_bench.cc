@@ -25,7 +25,6 @@
 #include <string.h>
 #include <sys/socket.h>
 #include <sys/time.h>
-#include <sys/un.h>
 #include <unistd.h>
 
 #include <cmath>
@@ -37,6 +36,7 @@
 #include "kestrel_log.h"
 #include "kestrel_platform.h"
 #include "sensor1_messages.h"
+#include "sensor1_wire.h"
 #include "tools/sim/simulator.h"
 
 namespace {
@@ -84,57 +84,19 @@ uint32_t relay_kernel_port(size_t i) {
 
 // ---- The relays (each runs as a child process of this program) ----
 
-bool send_all(int fd, const uint8_t* data, size_t size) {
-  while (size > 0) {
-    const ssize_t n = send(fd, data, size, MSG_NOSIGNAL);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    data += n;
-    size -= static_cast<size_t>(n);
-  }
-  return true;
-}
-
-// Connects to the simulator at path and does the OPEN handshake of the sensor1 wire protocol.
-int connect_to_simulator(const char* path) {
-  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un addr;
-  memset(&addr, 0, sizeof addr);
-  addr.sun_family = AF_UNIX;
-  snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path);
-  if (fd < 0 || connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return -1;
-  uint8_t open_record[5];
-  store_u32(open_record, 0, 1);
-  open_record[4] = kestrel_sim::kOpen;
-  uint8_t answer[9];
-  if (!send_all(fd, open_record, sizeof open_record) ||
-      recv(fd, answer, sizeof answer, MSG_WAITALL) != sizeof answer ||
-      answer[4] != kestrel_sim::kOpenResult || load_i32(answer, 5) != 0) {
-    return -1;
-  }
-  return fd;
-}
-
-// WRITE: u32 length, kind, HDR (service, msg_id, size, txn, 0), the 12-byte self-test request
-// (SensorID 0, TestType 6).
+// WRITE of the 12-byte self-test request (SensorID 0, TestType 6), its txn id counting up.
 struct WriteRecord {
-  uint8_t bytes[4 + 1 + 12 + 12] = {};
+  std::vector<uint8_t> bytes;
   WriteRecord() {
-    store_u32(bytes, 0, sizeof bytes - 4);
-    bytes[4] = kestrel_sim::kWrite;
-    store_u32(bytes, 5, kServiceSmgr);
-    store_i32(bytes, 9, kMsgSmgrSingleSensorTest);
-    store_u16(bytes, 13, 12);
-    store_u32(bytes, 17 + 4, 6);
+    uint8_t request[12] = {};
+    store_u32(request, 4, 6);
+    bytes = sensor1_wire::encode(
+        sensor1_wire::message(sensor1_wire::kWrite, {kServiceSmgr, kMsgSmgrSingleSensorTest, 0, 0},
+                              request, sizeof request));
   }
-  void next_txn() { bytes[15] = static_cast<uint8_t>(bytes[15] + 1); }
+  void next_txn() { ++bytes[kTxnAt]; }
+  static constexpr size_t kTxnAt = sensor1_wire::kLengthSize + 1 + 10;
 };
-
-// A record of the simulator: u32 length, kind, HDR, body. The indication's SensorID, TestType
-// and result words sit at fixed offsets of it.
-constexpr size_t kRecordBody = 4 + 1 + 12;
-constexpr size_t kRecordWords = kRecordBody + kTestIndWordsOffset;
-constexpr size_t kIndicationRecordSize = kRecordBody + 84;
 
 // Reads whole records from the simulator and keeps the words of the latest indication.
 class RecordReader {
@@ -152,14 +114,14 @@ class RecordReader {
     have_ += static_cast<size_t>(got);
     bool indication = false;
     size_t pos = 0;
-    while (have_ - pos >= 4 && have_ - pos >= 4 + load_u32(rx_.data(), pos)) {
-      const uint8_t* rec = rx_.data() + pos;
-      if (4 + load_u32(rec, 0) >= kIndicationRecordSize && rec[4] == kestrel_sim::kIndication) {
-        memcpy(words, rec + kRecordWords, sizeof words);
-        if (log_lines) log_callback_lines(rec);
+    sensor1_wire::Record rec;
+    for (long span; (span = sensor1_wire::parse(rx_.data() + pos, have_ - pos, &rec)) > 0;
+         pos += static_cast<size_t>(span)) {
+      if (rec.kind == sensor1_wire::kIndication && rec.header.msg_size >= 84) {
+        memcpy(words, rec.body + kTestIndWordsOffset, sizeof words);
+        if (log_lines) log_callback_lines(rec.body);
         indication = true;
       }
-      pos += 4 + load_u32(rec, 0);
     }
     memmove(rx_.data(), rx_.data() + pos, have_ - pos);
     have_ -= pos;
@@ -170,10 +132,10 @@ class RecordReader {
 
  private:
   // The service callback's lines for a passed test indication.
-  static void log_callback_lines(const uint8_t* rec) {
-    const uint8_t* w = rec + kRecordWords;
-    KLOGI("%s, SensorID:%d, TestType:%d", "rcv_test_msg", rec[kRecordBody],
-          load_i32(rec, kRecordBody + 4));
+  static void log_callback_lines(const uint8_t* body) {
+    const uint8_t* w = body + kTestIndWordsOffset;
+    KLOGI("%s, SensorID:%d, TestType:%d", "rcv_test_msg", body[kTestIndSensorIdOffset],
+          load_i32(body, kTestIndTestTypeOffset));
     KLOGI(
         "%s: Registers Received test Passed1: %i, %d, %d, %d, %d, %d, %d, %d, %d, %d, %d, %d, %d, "
         "%d, %d",
@@ -247,7 +209,8 @@ void build_reply(uint32_t port, const uint8_t (&words)[32], uint8_t (&reply)[16 
 int run_relay(size_t i, const char* socket_path) {
   const unsigned duties = kRelays[i].duties;
   const bool log_lines = (duties & kLogLines) != 0;
-  const int sim = connect_to_simulator(socket_path);
+  int32_t opened = 0;
+  const int sim = sensor1_wire::connect_and_open(socket_path, 10, &opened);
   const int nl = socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, platform_netlink_protocol());
   sockaddr_nl own;
   memset(&own, 0, sizeof own);
@@ -289,7 +252,9 @@ int run_relay(size_t i, const char* socket_path) {
       KLOGI("%s: msg_hdr.msg_id = 0x%x, id = %u\n", "get_selftest_result", 13, 0u);
     }
     write_record.next_txn();
-    if (!send_all(sim, write_record.bytes, sizeof write_record.bytes)) return 1;
+    if (!sensor1_wire::send_all(sim, write_record.bytes.data(), write_record.bytes.size())) {
+      return 1;
+    }
     if (log_lines) KLOGI("waiting for response IN - timeout=%d", 8000);
     if ((duties & kHandOver) != 0) {
       wait_for_hand_over(&hand_over, words);

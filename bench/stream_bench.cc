@@ -16,7 +16,6 @@
 #include <stdio.h>
 #include <string.h>
 #include <sys/socket.h>
-#include <sys/un.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -28,6 +27,7 @@
 #include "kernel_frame.h"
 #include "kestrel_platform.h"
 #include "sensor1_messages.h"
+#include "sensor1_wire.h"
 #include "tools/sim/simulator.h"
 
 namespace {
@@ -44,29 +44,11 @@ constexpr double kMaxRate = 4e6;
 
 // ---- The bare relay (run as a child process of this program) ----
 
-int connect_to_simulator(const char* path) {
-  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un addr;
-  memset(&addr, 0, sizeof addr);
-  addr.sun_family = AF_UNIX;
-  snprintf(addr.sun_path, sizeof addr.sun_path, "%s", path);
-  if (fd < 0 || connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) return -1;
-  uint8_t open_record[5];
-  store_u32(open_record, 0, 1);
-  open_record[4] = kestrel_sim::kOpen;
-  uint8_t answer[9];
-  if (send(fd, open_record, sizeof open_record, MSG_NOSIGNAL) != sizeof open_record ||
-      recv(fd, answer, sizeof answer, MSG_WAITALL) != sizeof answer || answer[4] != 64 ||
-      load_i32(answer, 5) != 0) {
-    return -1;
-  }
-  return fd;
-}
-
 // Reads records in chunks as the sensor1 library does and sends one 32-byte frame for each
 // indication, its three words' low halves as the values: no conversion, no lock, no allocation.
 int run_relay(const char* socket_path) {
-  const int sim = connect_to_simulator(socket_path);
+  int32_t opened = 0;
+  const int sim = sensor1_wire::connect_and_open(socket_path, 10, &opened);
   const int nl = socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, platform_netlink_protocol());
   if (sim < 0 || nl < 0) {
     fprintf(stderr, "relay: cannot set up its sockets\n");
@@ -84,24 +66,21 @@ int run_relay(const char* socket_path) {
     if (got <= 0) return 0;
     have += static_cast<size_t>(got);
     size_t pos = 0;
-    while (have - pos >= 4 && have - pos >= 4 + load_u32(rx.data(), pos)) {
-      const uint32_t len = load_u32(rx.data(), pos);
-      const uint8_t* rec = rx.data() + pos + 4;
-      // INDICATION: kind, HDR (12 bytes), body: the words at 12, 16 and 20.
-      if (len >= 1 + 12 + 24 && rec[0] == kestrel_sim::kIndication) {
-        memset(frame, 0, sizeof frame);
-        nlmsghdr hdr;
-        memset(&hdr, 0, sizeof hdr);
-        hdr.nlmsg_len = sizeof frame;
-        hdr.nlmsg_type = FRAME_SAMPLE;
-        memcpy(frame, &hdr, sizeof hdr);
-        for (int i = 0; i < 3; ++i) {
-          store_u16(frame, 16 + 4 + 2 * i,
-                    static_cast<uint16_t>(load_u32(rec, 13 + kSampleXOffset + 4 * i) & 0xffff));
-        }
-        sendto(nl, frame, sizeof frame, 0, reinterpret_cast<sockaddr*>(&kernel), sizeof kernel);
+    sensor1_wire::Record rec;
+    for (long span; (span = sensor1_wire::parse(rx.data() + pos, have - pos, &rec)) > 0;
+         pos += static_cast<size_t>(span)) {
+      if (rec.kind != sensor1_wire::kIndication || rec.header.msg_size < 24) continue;
+      memset(frame, 0, sizeof frame);
+      nlmsghdr hdr;
+      memset(&hdr, 0, sizeof hdr);
+      hdr.nlmsg_len = sizeof frame;
+      hdr.nlmsg_type = FRAME_SAMPLE;
+      memcpy(frame, &hdr, sizeof hdr);
+      for (int i = 0; i < 3; ++i) {
+        store_u16(frame, 16 + 4 + 2 * i,
+                  static_cast<uint16_t>(load_u32(rec.body, kSampleXOffset + 4 * i) & 0xffff));
       }
-      pos += 4 + len;
+      sendto(nl, frame, sizeof frame, 0, reinterpret_cast<sockaddr*>(&kernel), sizeof kernel);
     }
     memmove(rx.data(), rx.data() + pos, have - pos);
     have -= pos;

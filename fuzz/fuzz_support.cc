@@ -17,6 +17,7 @@
 
 #include <atomic>
 
+#include "byte_order.h"
 #include "diag/diag_logging.h"
 #include "kernel_channel/netlink_channel.h"
 #include "requests/raw_data.h"
@@ -89,18 +90,6 @@ int payload_length(uint16_t type) {
   }
 }
 
-uint32_t get_u32(const uint8_t* p) {
-  uint32_t v;
-  memcpy(&v, p, sizeof v);
-  return v;
-}
-
-uint16_t get_u16(const uint8_t* p) {
-  uint16_t v;
-  memcpy(&v, p, sizeof v);
-  return v;
-}
-
 void check_frame(int fd, const struct msghdr* msg) {
   if (fd != kernel_channel()) fail("frame sent on descriptor %d, not the kernel channel", fd);
   if (msg == nullptr || msg->msg_iov == nullptr || msg->msg_iovlen != 1) {
@@ -117,15 +106,15 @@ void check_frame(int fd, const struct msghdr* msg) {
   const auto* frame = static_cast<const uint8_t*>(msg->msg_iov->iov_base);
   const size_t size = msg->msg_iov->iov_len;
   if (frame == nullptr || size < kHeaderSize) fail("frame of %zu bytes", size);
-  const uint32_t len = get_u32(frame);
-  const uint16_t type = get_u16(frame + 4);
+  const uint32_t len = load_u32(frame, 0);
+  const uint16_t type = load_u16(frame, 4);
   const int payload = payload_length(type);
   if (payload < 0) fail("frame of type %u, which the daemon never sends", type);
   const uint32_t expected = (static_cast<uint32_t>(payload) + kHeaderSize + 3) & ~3u;
   if (len != expected || size != expected) {
     fail("frame type %u: nlmsg_len %u, buffer %zu, expected %u", type, len, size, expected);
   }
-  if (get_u16(frame + 6) != 0 || get_u32(frame + 8) != 0 || get_u32(frame + 12) != kDaemonPort) {
+  if (load_u16(frame, 6) != 0 || load_u32(frame, 8) != 0 || load_u32(frame, 12) != kDaemonPort) {
     fail("frame type %u: flags, seq or pid wrong", type);
   }
   for (size_t i = kHeaderSize + static_cast<size_t>(payload); i < size; ++i) {

@@ -1,11 +1,5 @@
 // The sensor1 client library of the host build. Each connection is a Unix stream socket to
-// kestrel-sim at KESTREL_SENSOR1_SOCKET. Both directions carry records:
-//
-//   u32 length (bytes that follow) | u8 kind | fields of the kind
-//
-// with a message header HDR = u32 service, i32 msg_id, u16 msg_size, u8 txn_id, u8 0, followed
-// by msg_size body bytes. The library writes OPEN, WRITE and FAULT_ACK; the simulator writes
-// OPEN_RESULT, RESPONSE, INDICATION, RETRY_OPEN, FAULT and CALLBACK.
+// kestrel-sim at KESTREL_SENSOR1_SOCKET carrying the records of sensor1_wire.h.
 //
 // One library thread, started by the first successful open, polls every open connection and
 // calls each connection's callback, one message at a time, in arrival order. No library lock is
@@ -39,58 +33,17 @@
 
 #include "host_env.h"
 #include "sensor1_host.h"
+#include "sensor1_wire.h"
 
 namespace {
 
+using sensor1_wire::FaultOp;
+using sensor1_wire::Record;
+
 constexpr char kTag[] = "libsensor1";
-
-// Record kinds.
-constexpr uint8_t kRecOpen = 1;
-constexpr uint8_t kRecWrite = 2;
-constexpr uint8_t kRecFaultAck = 3;
-constexpr uint8_t kRecOpenResult = 64;
-constexpr uint8_t kRecResponse = 65;
-constexpr uint8_t kRecIndication = 66;
-constexpr uint8_t kRecRetryOpen = 67;
-constexpr uint8_t kRecFault = 68;
-constexpr uint8_t kRecCallback = 69;
-
-constexpr size_t kHdrSize = 12;
-// Largest record accepted from the simulator: a full 16-bit body, its header and a few fields.
-constexpr uint32_t kMaxRecord = 65535 + kHdrSize + 16;
 // How long an open waits for OPEN_RESULT before it gives up with 11.
-constexpr time_t kHandshakeTimeoutSeconds = 10;
-
-// Fault operations, as numbered on the wire.
-constexpr uint8_t kOpAlloc = 1;
-constexpr uint8_t kOpWrite = 2;
-constexpr uint8_t kOpClose = 3;
+constexpr int kHandshakeTimeoutSeconds = 10;
 constexpr int kOpCount = 3;
-
-uint32_t get_u32(const uint8_t* p) {
-  uint32_t v;
-  memcpy(&v, p, sizeof v);
-  return v;
-}
-int32_t get_i32(const uint8_t* p) {
-  int32_t v;
-  memcpy(&v, p, sizeof v);
-  return v;
-}
-uint16_t get_u16(const uint8_t* p) {
-  uint16_t v;
-  memcpy(&v, p, sizeof v);
-  return v;
-}
-void put_u32(uint8_t* p, uint32_t v) {
-  memcpy(p, &v, sizeof v);
-}
-void put_i32(uint8_t* p, int32_t v) {
-  memcpy(p, &v, sizeof v);
-}
-void put_u16(uint8_t* p, uint16_t v) {
-  memcpy(p, &v, sizeof v);
-}
 
 enum class LinkState { kOpen, kEnded, kClosed };
 
@@ -149,28 +102,6 @@ void release_body(void* body) {
   g_outstanding.fetch_sub(1);
 }
 
-bool send_all(int fd, const uint8_t* data, size_t size) {
-  while (size > 0) {
-    const ssize_t n = send(fd, data, size, MSG_NOSIGNAL);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    data += n;
-    size -= static_cast<size_t>(n);
-  }
-  return true;
-}
-
-bool recv_exact(int fd, uint8_t* data, size_t size) {
-  while (size > 0) {
-    const ssize_t n = recv(fd, data, size, 0);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    data += n;
-    size -= static_cast<size_t>(n);
-  }
-  return true;
-}
-
 void wake_thread() {
   const uint8_t b = 1;
   ssize_t ignored = write(g_wake[1], &b, 1);
@@ -178,24 +109,22 @@ void wake_thread() {
 }
 
 // Consumes one fault of op on h, if one is armed. Called with g_lock held.
-bool take_fault(sensor1_handle_s* h, uint8_t op, int* result) {
-  Fault& f = h->faults[op - 1];
+bool take_fault(sensor1_handle_s* h, FaultOp op, int* result) {
+  Fault& f = h->faults[static_cast<int>(op) - 1];
   if (f.count == 0) return false;
   --f.count;
   *result = f.result;
   return true;
 }
 
-const char* op_name(uint8_t op) {
+const char* op_name(FaultOp op) {
   switch (op) {
-    case kOpAlloc:
+    case FaultOp::kAlloc:
       return "alloc";
-    case kOpWrite:
+    case FaultOp::kWrite:
       return "write";
-    case kOpClose:
-      return "close";
     default:
-      return "unknown";
+      return "close";
   }
 }
 
@@ -212,9 +141,10 @@ void run_callback(sensor1_handle_s* h, sensor1_msg_header_s* hdr, int type, void
 }
 
 // Sends one record on h under its io_lock. False when the connection is gone.
-bool send_record(sensor1_handle_s* h, const uint8_t* data, size_t size) {
+bool send_record(sensor1_handle_s* h, const Record& rec) {
+  const std::vector<uint8_t> bytes = sensor1_wire::encode(rec);
   pthread_mutex_lock(&h->io_lock);
-  const bool ok = h->fd >= 0 && send_all(h->fd, data, size);
+  const bool ok = h->fd >= 0 && sensor1_wire::send_all(h->fd, bytes.data(), bytes.size());
   pthread_mutex_unlock(&h->io_lock);
   return ok;
 }
@@ -244,76 +174,55 @@ bool is_open(sensor1_handle_s* h) {
   return open;
 }
 
-// Reads HDR at p (kHdrSize bytes) and the body after it (at most avail bytes) into hdr and a
-// body of the library's allocator. False when the record is too short for the size it claims.
-bool take_message(const uint8_t* p, size_t avail, sensor1_msg_header_s* hdr, void** body) {
-  if (avail < kHdrSize) return false;
-  memset(hdr, 0, sizeof *hdr);
-  hdr->service_number = get_u32(p);
-  hdr->msg_id = get_i32(p + 4);
-  hdr->msg_size = get_u16(p + 8);
-  hdr->txn_id = p[10];
-  if (avail - kHdrSize < hdr->msg_size) return false;
-  *body = alloc_body(hdr->msg_size);
-  if (*body != nullptr && hdr->msg_size > 0) memcpy(*body, p + kHdrSize, hdr->msg_size);
-  return true;
+// A body of the library's allocator holding the record's body.
+void* copy_body(const Record& rec) {
+  void* body = alloc_body(rec.header.msg_size);
+  if (body != nullptr && rec.header.msg_size > 0) memcpy(body, rec.body, rec.header.msg_size);
+  return body;
 }
 
-void apply_fault(sensor1_handle_s* h, const uint8_t* p, size_t avail) {
-  if (avail < 9) return;
-  const uint8_t op = p[0];
-  const int32_t result = get_i32(p + 1);
-  const uint32_t count = get_u32(p + 5);
-  if (op >= kOpAlloc && op <= kOpClose) {
+void apply_fault(sensor1_handle_s* h, const Record& rec) {
+  if (rec.op >= 1 && rec.op <= kOpCount) {
+    const FaultOp op = static_cast<FaultOp>(rec.op);
     pthread_mutex_lock(&g_lock);
-    h->faults[op - 1].result = result;
-    h->faults[op - 1].count = count;
+    h->faults[rec.op - 1].result = rec.value;
+    h->faults[rec.op - 1].count = rec.count;
     pthread_mutex_unlock(&g_lock);
-    __android_log_print(ANDROID_LOG_INFO, kTag, "fault %s -> %d count %u", op_name(op), result,
-                        count);
+    __android_log_print(ANDROID_LOG_INFO, kTag, "fault %s -> %d count %u", op_name(op), rec.value,
+                        rec.count);
   }
-  uint8_t ack[6];
-  put_u32(ack, 2);
-  ack[4] = kRecFaultAck;
-  ack[5] = op;
-  send_record(h, ack, sizeof ack);
+  Record ack = sensor1_wire::plain(sensor1_wire::kFaultAck);
+  ack.op = rec.op;
+  send_record(h, ack);
 }
 
-// Handles one record (kind and fields in p, size bytes). False on a malformed record.
-bool deliver(sensor1_handle_s* h, const uint8_t* p, size_t size) {
-  const uint8_t kind = p[0];
-  const uint8_t* f = p + 1;
-  const size_t avail = size - 1;
+// Hands one record of the simulator to h's callback (or applies it).
+void deliver(sensor1_handle_s* h, const Record& rec) {
   sensor1_msg_header_s hdr;
   memset(&hdr, 0, sizeof hdr);
-  void* body = nullptr;
-  switch (kind) {
-    case kRecResponse:
-    case kRecIndication:
-      if (!take_message(f, avail, &hdr, &body)) return false;
-      run_callback(h, &hdr, kind == kRecResponse ? SENSOR1_MSG_TYPE_RESP : SENSOR1_MSG_TYPE_IND,
-                   body);
-      return true;
-    case kRecRetryOpen:
+  hdr.service_number = rec.header.service;
+  hdr.msg_id = rec.header.msg_id;
+  hdr.msg_size = rec.header.msg_size;
+  hdr.txn_id = rec.header.txn_id;
+  switch (rec.kind) {
+    case sensor1_wire::kResponse:
+      run_callback(h, &hdr, SENSOR1_MSG_TYPE_RESP, copy_body(rec));
+      return;
+    case sensor1_wire::kIndication:
+      run_callback(h, &hdr, SENSOR1_MSG_TYPE_IND, copy_body(rec));
+      return;
+    case sensor1_wire::kRetryOpen:
       run_callback(h, &hdr, SENSOR1_MSG_TYPE_RETRY_OPEN, nullptr);
-      return true;
-    case kRecCallback: {
-      if (avail < 5) return false;
-      const int32_t type = get_i32(f);
-      const uint8_t flags = f[4];
-      if (!take_message(f + 5, avail - 5, &hdr, &body)) return false;
-      if ((flags & 2) == 0) {
-        release_body(body);
-        body = nullptr;
-      }
-      run_callback(h, (flags & 1) != 0 ? &hdr : nullptr, type, body);
-      return true;
-    }
-    case kRecFault:
-      apply_fault(h, f, avail);
-      return true;
+      return;
+    case sensor1_wire::kCallback:
+      run_callback(h, (rec.flags & sensor1_wire::kWithHeader) != 0 ? &hdr : nullptr, rec.value,
+                   (rec.flags & sensor1_wire::kWithBody) != 0 ? copy_body(rec) : nullptr);
+      return;
+    case sensor1_wire::kFault:
+      apply_fault(h, rec);
+      return;
     default:
-      return true;  // a kind this library does not know is skipped
+      return;  // a kind this library does not read is skipped
   }
 }
 
@@ -321,30 +230,24 @@ bool deliver(sensor1_handle_s* h, const uint8_t* p, size_t size) {
 // callback, or by another thread). False when the stream is malformed.
 bool deliver_buffered(sensor1_handle_s* h) {
   size_t pos = 0;
-  bool ok = true;
-  while (h->rx.size() - pos >= 4) {
-    const uint32_t len = get_u32(h->rx.data() + pos);
-    if (len == 0 || len > kMaxRecord) {
-      ok = false;
-      break;
+  for (;;) {
+    Record rec;
+    const long span = sensor1_wire::parse(h->rx.data() + pos, h->rx.size() - pos, &rec);
+    if (span < 0) {
+      h->rx.clear();
+      return false;
     }
-    if (h->rx.size() - pos - 4 < len) break;
+    if (span == 0) break;
     if (!is_open(h)) {
       h->rx.clear();
       return true;
     }
-    // The callback may open connections or close this one; the record is copied out first.
-    std::vector<uint8_t> record(h->rx.begin() + static_cast<long>(pos) + 4,
-                                h->rx.begin() + static_cast<long>(pos) + 4 + len);
-    pos += 4 + len;
-    if (!deliver(h, record.data(), record.size())) {
-      ok = false;
-      break;
-    }
-  }
-  if (!ok) {
-    h->rx.clear();
-    return false;
+    // The callback may open connections or close this one: the record is copied out first.
+    const std::vector<uint8_t> copy(h->rx.begin() + static_cast<long>(pos),
+                                    h->rx.begin() + static_cast<long>(pos) + span);
+    pos += static_cast<size_t>(span);
+    sensor1_wire::parse(copy.data(), copy.size(), &rec);
+    deliver(h, rec);
   }
   h->rx.erase(h->rx.begin(), h->rx.begin() + static_cast<long>(pos));
   return true;
@@ -372,7 +275,6 @@ void* library_thread(void*) {
   t_library_thread = true;
   std::vector<pollfd> fds;
   std::vector<sensor1_handle_s*> polled;
-  std::vector<uint8_t> chunk(64 * 1024);
   for (;;) {
     close_retired_descriptors();
     fds.clear();
@@ -398,17 +300,8 @@ void* library_thread(void*) {
       if (fds[i].revents == 0) continue;
       sensor1_handle_s* h = polled[i - 1];
       if (!is_open(h)) continue;
-      ssize_t got;
-      do {
-        got = recv(fds[i].fd, chunk.data(), chunk.size(), MSG_DONTWAIT);
-      } while (got < 0 && errno == EINTR);
-      if (got < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) continue;
-      if (got <= 0) {
-        end_connection(h);
-        continue;
-      }
-      h->rx.insert(h->rx.end(), chunk.begin(), chunk.begin() + got);
-      if (!deliver_buffered(h)) end_connection(h);
+      const int got = sensor1_wire::receive_available(fds[i].fd, &h->rx);
+      if (got != 0 && (got < 0 || !deliver_buffered(h))) end_connection(h);
     }
   }
   return nullptr;
@@ -420,45 +313,6 @@ void start_library_thread() {
   if (pthread_create(&thread, nullptr, library_thread, nullptr) != 0) return;
   pthread_detach(thread);
   g_thread_started = true;
-}
-
-// Connects to the simulator and does the OPEN handshake. Returns the descriptor, or -1 with
-// *result set.
-int connect_and_handshake(int* result) {
-  *result = SENSOR1_EWOULDBLOCK;
-  const char* path = host_environment().sensor1_socket;
-  sockaddr_un addr;
-  memset(&addr, 0, sizeof addr);
-  addr.sun_family = AF_UNIX;
-  if (strlen(path) >= sizeof addr.sun_path) return -1;
-  strcpy(addr.sun_path, path);
-  const int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (fd < 0) return -1;
-  if (connect(fd, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) != 0) {
-    close(fd);
-    return -1;
-  }
-  // A simulator that accepted but never answers must not hang the caller.
-  timeval tv = {kHandshakeTimeoutSeconds, 0};
-  setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
-  uint8_t open_rec[5];
-  put_u32(open_rec, 1);
-  open_rec[4] = kRecOpen;
-  // Exactly the OPEN_RESULT record is read here; whatever follows it belongs to the thread.
-  uint8_t answer[9];
-  if (!send_all(fd, open_rec, sizeof open_rec) || !recv_exact(fd, answer, sizeof answer) ||
-      get_u32(answer) != 5 || answer[4] != kRecOpenResult) {
-    close(fd);
-    return -1;
-  }
-  *result = get_i32(answer + 5);
-  if (*result != SENSOR1_SUCCESS) {
-    close(fd);
-    return -1;
-  }
-  tv = {0, 0};
-  setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv);
-  return fd;
 }
 
 }  // namespace
@@ -474,8 +328,9 @@ int sensor1_open(sensor1_handle_s** handle, sensor1_notify_data_cb_t cb, intptr_
     log_line("open -> %d", SENSOR1_HOST_EINVAL);
     return SENSOR1_HOST_EINVAL;
   }
-  int result = 0;
-  const int fd = connect_and_handshake(&result);
+  int32_t result = 0;
+  const int fd = sensor1_wire::connect_and_open(host_environment().sensor1_socket,
+                                                kHandshakeTimeoutSeconds, &result);
   if (fd < 0) {
     log_line("open -> %d", result);
     return result;
@@ -512,7 +367,7 @@ int sensor1_close(sensor1_handle_s* handle) {
   if (handle->state == LinkState::kClosed) {
     result = SENSOR1_HOST_EINVAL;
   } else {
-    take_fault(handle, kOpClose, &result);
+    take_fault(handle, FaultOp::kClose, &result);
     handle->fd_to_close = true;
     handle->state = LinkState::kClosed;
     closed_now = true;
@@ -542,7 +397,7 @@ int sensor1_alloc_msg_buf(sensor1_handle_s* handle, uint16_t size, void** buf) {
   } else if (handle->state == LinkState::kEnded) {
     result = SENSOR1_HOST_EPIPE;
   } else {
-    take_fault(handle, kOpAlloc, &result);
+    take_fault(handle, FaultOp::kAlloc, &result);
   }
   pthread_mutex_unlock(&g_lock);
   if (result != SENSOR1_SUCCESS) return result;
@@ -560,14 +415,9 @@ int sensor1_free_msg_buf(sensor1_handle_s*, void* buf) {
 int sensor1_write(sensor1_handle_s* handle, sensor1_msg_header_s* hdr, void* body) {
   if (handle == nullptr || hdr == nullptr) return SENSOR1_HOST_EINVAL;
   if (body == nullptr && hdr->msg_size != 0) return SENSOR1_HOST_EINVAL;
-  std::vector<uint8_t> rec(4 + 1 + kHdrSize + hdr->msg_size, 0);
-  put_u32(rec.data(), static_cast<uint32_t>(rec.size() - 4));
-  rec[4] = kRecWrite;
-  put_u32(&rec[5], hdr->service_number);
-  put_i32(&rec[9], hdr->msg_id);
-  put_u16(&rec[13], hdr->msg_size);
-  rec[15] = hdr->txn_id;
-  if (hdr->msg_size > 0) memcpy(&rec[17], body, hdr->msg_size);
+  const std::vector<uint8_t> rec = sensor1_wire::encode(sensor1_wire::message(
+      sensor1_wire::kWrite, {hdr->service_number, hdr->msg_id, 0, hdr->txn_id},
+      static_cast<const uint8_t*>(body), hdr->msg_size));
 
   pthread_mutex_lock(&handle->io_lock);
   pthread_mutex_lock(&g_lock);
@@ -578,12 +428,12 @@ int sensor1_write(sensor1_handle_s* handle, sensor1_msg_header_s* hdr, void* bod
   } else if (handle->state == LinkState::kEnded) {
     result = SENSOR1_HOST_EPIPE;
   } else {
-    faulted = take_fault(handle, kOpWrite, &result);
+    faulted = take_fault(handle, FaultOp::kWrite, &result);
   }
   pthread_mutex_unlock(&g_lock);
   // A write faulted with EWOULDBLOCK still goes out and takes the body, like a success.
   const bool send = result == SENSOR1_SUCCESS || (faulted && result == SENSOR1_EWOULDBLOCK);
-  if (send && !(handle->fd >= 0 && send_all(handle->fd, rec.data(), rec.size()))) {
+  if (send && !(handle->fd >= 0 && sensor1_wire::send_all(handle->fd, rec.data(), rec.size()))) {
     result = SENSOR1_HOST_EPIPE;
   }
   pthread_mutex_unlock(&handle->io_lock);

@@ -26,8 +26,6 @@ namespace kestrel_sim {
 
 namespace {
 
-constexpr size_t kHdrSize = 12;
-constexpr uint32_t kMaxRecord = 65535 + kHdrSize + 16;
 // A library thread that stops reading (a callback blocked for good) must not hang the sender.
 constexpr Millis kSendTimeout(5000);
 
@@ -46,41 +44,9 @@ struct Conn {
 
 using ConnPtr = std::shared_ptr<Conn>;
 
-void append_u32(std::vector<uint8_t>* v, uint32_t x) {
-  const size_t at = v->size();
-  v->resize(at + 4);
-  store_u32(v->data(), at, x);
-}
-
-// Frame of a record: the length is patched once the fields are in.
-std::vector<uint8_t> begin_record(RecordKind kind) {
-  std::vector<uint8_t> rec(5, 0);
-  rec[4] = kind;
-  return rec;
-}
-
-void finish_record(std::vector<uint8_t>* rec) {
-  store_u32(rec->data(), 0, static_cast<uint32_t>(rec->size() - 4));
-}
-
-void append_message(std::vector<uint8_t>* rec, const Header& header,
-                    const std::vector<uint8_t>& body) {
-  const size_t size = std::min<size_t>(body.size(), 65535);
-  const size_t at = rec->size();
-  rec->resize(at + kHdrSize);
-  store_u32(rec->data(), at, header.service);
-  store_i32(rec->data(), at + 4, header.msg_id);
-  store_u16(rec->data(), at + 8, static_cast<uint16_t>(size));
-  store_u8(rec->data(), at + 10, header.txn_id);
-  rec->insert(rec->end(), body.begin(), body.begin() + static_cast<long>(size));
-}
-
-std::vector<uint8_t> message_record(RecordKind kind, const Header& header,
+std::vector<uint8_t> message_record(sensor1_wire::Kind kind, const Header& header,
                                     const std::vector<uint8_t>& body) {
-  std::vector<uint8_t> rec = begin_record(kind);
-  append_message(&rec, header, body);
-  finish_record(&rec);
-  return rec;
+  return sensor1_wire::encode(sensor1_wire::message(kind, header, body.data(), body.size()));
 }
 
 bool send_with_timeout(int fd, const std::vector<uint8_t>& data, Millis timeout) {
@@ -218,9 +184,8 @@ struct Simulator::State {
           hook = connection_hook;
         }
       }
-      std::vector<uint8_t> rec = begin_record(kOpenResult);
-      append_u32(&rec, static_cast<uint32_t>(result));
-      finish_record(&rec);
+      const std::vector<uint8_t> rec =
+          sensor1_wire::encode(sensor1_wire::result(sensor1_wire::kOpenResult, result));
       sent = c->fd >= 0 && send_with_timeout(c->fd, rec, kSendTimeout);
     }
     if (!sent || result != 0) {
@@ -231,16 +196,12 @@ struct Simulator::State {
     if (hook) hook(*self, number, true);
   }
 
-  void handle_write(const ConnPtr& c, const uint8_t* f, size_t avail) {
-    if (c->number == 0 || avail < kHdrSize) return;
+  void handle_write(const ConnPtr& c, const sensor1_wire::Record& rec) {
+    if (c->number == 0) return;
     Request req;
     req.connection = c->number;
-    req.header.service = load_u32(f, 0);
-    req.header.msg_id = load_i32(f, 4);
-    req.header.msg_size = load_u16(f, 8);
-    req.header.txn_id = load_u8(f, 10);
-    const size_t size = std::min<size_t>(req.header.msg_size, avail - kHdrSize);
-    req.body.assign(f + kHdrSize, f + kHdrSize + size);
+    req.header = rec.header;
+    req.body.assign(rec.body, rec.body + rec.header.msg_size);
     RequestHook hook;
     bool answer;
     {
@@ -258,19 +219,19 @@ struct Simulator::State {
   // Handles every complete record in c->rx. False on a malformed stream.
   bool handle_records(const ConnPtr& c) {
     size_t pos = 0;
-    while (c->rx.size() - pos >= 4) {
-      const uint32_t len = load_u32(c->rx.data(), pos);
-      if (len == 0 || len > kMaxRecord) return false;
-      if (c->rx.size() - pos - 4 < len) break;
-      const uint8_t* rec = c->rx.data() + pos + 4;
-      switch (rec[0]) {
-        case kOpen:
+    for (;;) {
+      sensor1_wire::Record rec;
+      const long span = sensor1_wire::parse(c->rx.data() + pos, c->rx.size() - pos, &rec);
+      if (span < 0) return false;
+      if (span == 0) break;
+      switch (rec.kind) {
+        case sensor1_wire::kOpen:
           handle_open(c);
           break;
-        case kWrite:
-          handle_write(c, rec + 1, len - 1);
+        case sensor1_wire::kWrite:
+          handle_write(c, rec);
           break;
-        case kFaultAck: {
+        case sensor1_wire::kFaultAck: {
           std::lock_guard<std::mutex> lock(mu);
           ++c->fault_acks;
           cv.notify_all();
@@ -279,7 +240,7 @@ struct Simulator::State {
         default:
           break;
       }
-      pos += 4 + len;
+      pos += static_cast<size_t>(span);
     }
     c->rx.erase(c->rx.begin(), c->rx.begin() + static_cast<long>(pos));
     return true;
@@ -313,7 +274,6 @@ struct Simulator::State {
   void run() {
     std::vector<pollfd> fds;
     std::vector<ConnPtr> polled;
-    std::vector<uint8_t> chunk(64 * 1024);
     for (;;) {
       std::vector<std::pair<int, ConnectionHook>> ended_hooks;
       clean_up(&ended_hooks);
@@ -343,17 +303,8 @@ struct Simulator::State {
       for (size_t i = 0; i < polled.size(); ++i) {
         if (fds[i + 1].revents == 0) continue;
         const ConnPtr& c = polled[i];
-        ssize_t got;
-        do {
-          got = recv(c->fd, chunk.data(), chunk.size(), MSG_DONTWAIT);
-        } while (got < 0 && errno == EINTR);
-        if (got < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) continue;
-        if (got <= 0) {
-          mark_ended(c);
-          continue;
-        }
-        c->rx.insert(c->rx.end(), chunk.begin(), chunk.begin() + got);
-        if (!handle_records(c)) mark_ended(c);
+        const int got = sensor1_wire::receive_available(c->fd, &c->rx);
+        if (got != 0 && (got < 0 || !handle_records(c))) mark_ended(c);
       }
       if (listener >= 0 && fds.back().revents != 0) {
         const int fd = accept4(listener, nullptr, nullptr, SOCK_CLOEXEC);
@@ -499,11 +450,11 @@ void Simulator::clear_requests() {
 }
 
 void Simulator::respond(Header header, const std::vector<uint8_t>& body) {
-  state_->send_to(state_->current_conn(), message_record(kResponse, header, body));
+  state_->send_to(state_->current_conn(), message_record(sensor1_wire::kResponse, header, body));
 }
 
 void Simulator::indicate(Header header, const std::vector<uint8_t>& body) {
-  state_->send_to(state_->current_conn(), message_record(kIndication, header, body));
+  state_->send_to(state_->current_conn(), message_record(sensor1_wire::kIndication, header, body));
 }
 
 bool Simulator::respond_to(int connection, Header header, const std::vector<uint8_t>& body) {
@@ -512,7 +463,7 @@ bool Simulator::respond_to(int connection, Header header, const std::vector<uint
     std::lock_guard<std::mutex> lock(state_->mu);
     c = state_->find(connection);
   }
-  return state_->send_to(c, message_record(kResponse, header, body));
+  return state_->send_to(c, message_record(sensor1_wire::kResponse, header, body));
 }
 
 bool Simulator::indicate_to(int connection, Header header, const std::vector<uint8_t>& body) {
@@ -521,23 +472,22 @@ bool Simulator::indicate_to(int connection, Header header, const std::vector<uin
     std::lock_guard<std::mutex> lock(state_->mu);
     c = state_->find(connection);
   }
-  return state_->send_to(c, message_record(kIndication, header, body));
+  return state_->send_to(c, message_record(sensor1_wire::kIndication, header, body));
 }
 
 void Simulator::retry_open() {
-  std::vector<uint8_t> rec = begin_record(kRetryOpen);
-  finish_record(&rec);
-  state_->send_to(state_->current_conn(), rec);
+  state_->send_to(state_->current_conn(),
+                  sensor1_wire::encode(sensor1_wire::plain(sensor1_wire::kRetryOpen)));
 }
 
 void Simulator::callback(int32_t msg_type, bool with_header, bool with_body, Header header,
                          const std::vector<uint8_t>& body) {
-  std::vector<uint8_t> rec = begin_record(kCallback);
-  append_u32(&rec, static_cast<uint32_t>(msg_type));
-  rec.push_back(static_cast<uint8_t>((with_header ? 1 : 0) | (with_body ? 2 : 0)));
-  append_message(&rec, header, body);
-  finish_record(&rec);
-  state_->send_to(state_->current_conn(), rec);
+  sensor1_wire::Record rec =
+      sensor1_wire::message(sensor1_wire::kCallback, header, body.data(), body.size());
+  rec.value = msg_type;
+  rec.flags = static_cast<uint8_t>((with_header ? sensor1_wire::kWithHeader : 0) |
+                                   (with_body ? sensor1_wire::kWithBody : 0));
+  state_->send_to(state_->current_conn(), sensor1_wire::encode(rec));
 }
 
 bool Simulator::fault(FaultOp op, int32_t result, uint32_t count, Millis timeout) {
@@ -550,12 +500,10 @@ bool Simulator::fault(FaultOp op, int32_t result, uint32_t count, Millis timeout
     if (c == nullptr) return false;
     before = c->fault_acks;
   }
-  std::vector<uint8_t> rec = begin_record(kFault);
-  rec.push_back(static_cast<uint8_t>(op));
-  append_u32(&rec, static_cast<uint32_t>(result));
-  append_u32(&rec, count);
-  finish_record(&rec);
-  if (!state_->send_to(c, rec)) return false;
+  sensor1_wire::Record rec = sensor1_wire::result(sensor1_wire::kFault, result);
+  rec.op = static_cast<uint8_t>(op);
+  rec.count = count;
+  if (!state_->send_to(c, sensor1_wire::encode(rec))) return false;
   std::unique_lock<std::mutex> lock(state_->mu);
   return state_->cv.wait_for(lock, timeout, [&] { return c->fault_acks > before; });
 }

@@ -14,29 +14,12 @@
 #include <string>
 #include <vector>
 
+#include "sensor1_wire.h"
+
 namespace kestrel_sim {
 
-// Wire record kinds.
-enum RecordKind : uint8_t {
-  kOpen = 1,
-  kWrite = 2,
-  kFaultAck = 3,
-  kOpenResult = 64,
-  kResponse = 65,
-  kIndication = 66,
-  kRetryOpen = 67,
-  kFault = 68,
-  kCallback = 69,
-};
-
-enum class FaultOp : uint8_t { kAlloc = 1, kWrite = 2, kClose = 3 };
-
-struct Header {
-  uint32_t service = 0;
-  int32_t msg_id = 0;
-  uint16_t msg_size = 0;  // filled from the body when sent
-  uint8_t txn_id = 0;
-};
+using FaultOp = sensor1_wire::FaultOp;
+using Header = sensor1_wire::Header;  // msg_size is filled from the body when sent
 
 // One sensor1_write of the daemon, as received.
 struct Request {
