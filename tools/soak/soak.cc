@@ -43,20 +43,19 @@
 #include "frame_codec.h"
 #include "kernel_frame.h"
 #include "tools/sim/simulator.h"
+#include "tools/soak/daemon_driver.h"
 
 #ifndef KESTRELD_BINARY
 #error "KESTRELD_BINARY names the daemon to soak"
 #endif
 
-extern char** environ;
-
 namespace {
+
+using namespace kestrel_soak;
 
 using Clock = std::chrono::steady_clock;
 using namespace std::chrono_literals;
 
-constexpr uint32_t kKernelPort = 100;
-constexpr uint32_t kDaemonPort = 20000;
 constexpr int kExitStatus = 77;  // the close result that ends the run
 // Injected samples in flight (sent to the daemon, frame not yet back) at most.
 constexpr long kInjectWindow = 2000;
@@ -124,58 +123,6 @@ bool parse_options(int argc, char** argv, Options* o) {
     }
   }
   return o->indications >= 0 && o->commands >= 10 && o->time_scale > 0;
-}
-
-void write_text(const std::string& path, const std::string& text, mode_t mode = 0644) {
-  std::ofstream(path, std::ios::trunc) << text;
-  chmod(path.c_str(), mode);
-}
-
-// ---------------------------------------------------------------------------------------------
-// The commands: one cycle holds every kind the daemon serves, with the reply frame type each
-// must bring back from a healthy phone (-1: none). Command 36 runs four shell commands, each a
-// process of its own, so it comes in every tenth cycle only.
-
-struct Planned {
-  std::vector<uint8_t> datagram;
-  int reply = -1;
-};
-
-constexpr int kCommandKinds = 26;
-
-std::vector<Planned> cycle(long c) {
-  using kestrelctl::build_bigdata;
-  using kestrelctl::build_command;
-  const int32_t sensor =
-      static_cast<int32_t>(c % 4);            // accelerometer, gyro, magnetometer, pressure
-  const int32_t stream = c % 2 == 0 ? 0 : 4;  // a sensor-manager or a light-sensor stream
-  const int32_t calib[] = {0, 1, 2, 4};
-  const std::vector<uint8_t> data = {1, 2, 3, 4, 5, 6, 7, 8};
-  std::vector<Planned> out = {
-      {build_command(0, {sensor}), 0},
-      {build_command(1, {stream}), -1},
-      {build_command(3, {stream}), 3},
-      {build_command(4, {calib[c % 4]}), 5},
-      {build_command(6, {sensor, 1}), 7},
-      {build_command(8, {sensor}), sensor == 1 ? 14 : 9},
-      {build_command(10), 10},
-      {build_command(11), 11},
-      {build_command(12), 12},
-      {build_command(15), 15},
-      {build_command(16), 16},
-      {build_command(17), -1},
-      {build_command(18), -1},
-      {build_command(19, {static_cast<int32_t>(c % 6)}), 20},
-  };
-  for (uint16_t bulk : {22, 23, 24, 25, 26}) out.push_back({build_bigdata(bulk, 4, data), -1});
-  out.push_back({build_command(27, {0, 2}), -1});
-  out.push_back({build_bigdata(28, 4, data), 30});
-  out.push_back({build_bigdata(29, 4, data), 30});
-  out.push_back({build_bigdata(31, 4, data), 33});
-  out.push_back({build_bigdata(32, 4, data), 33});
-  out.push_back({kestrelctl::build_hidden_hole({1, 2, 3, 4, 5, 6, 7, 8, 9}), -1});
-  if (c % 10 == 9) out.push_back({build_command(36), -1});
-  return out;
 }
 
 // The commands one after the other, cycle after cycle.
@@ -296,135 +243,6 @@ void receive_frames(int fd, const std::atomic<bool>* stop, Tally* t) {
 }
 
 // ---------------------------------------------------------------------------------------------
-// The daemon's log: read from its stderr, counted, its latest lines kept for a failure report.
-
-struct LogTally {
-  std::mutex mu;
-  std::deque<std::string> last;
-  long lines = 0;
-  std::map<std::string, long> seen;  // by pattern
-};
-
-const char* const kLogPatterns[] = {
-    "ERROR: No response for command",
-    "sensor1_write -error",
-    "sensor1_write error",
-    "alloc_msg_buf error",
-    "get_raw error",
-    "BROKEN_PIPE",
-    "malformed",
-    "refused",
-    "cb has arrived without waiting",
-};
-
-void read_log(int fd, LogTally* log) {
-  std::string pending;
-  char buf[65536];
-  for (;;) {
-    const ssize_t n = read(fd, buf, sizeof buf);
-    if (n <= 0) break;
-    pending.append(buf, static_cast<size_t>(n));
-    size_t start = 0, nl;
-    std::lock_guard<std::mutex> lock(log->mu);
-    while ((nl = pending.find('\n', start)) != std::string::npos) {
-      const std::string line = pending.substr(start, nl - start);
-      start = nl + 1;
-      ++log->lines;
-      for (const char* pattern : kLogPatterns) {
-        if (line.find(pattern) != std::string::npos) ++log->seen[pattern];
-      }
-      log->last.push_back(line);
-      if (log->last.size() > 200) log->last.pop_front();
-    }
-    pending.erase(0, start);
-  }
-  close(fd);
-}
-
-// ---------------------------------------------------------------------------------------------
-// The daemon's process.
-
-struct Usage {
-  long rss_kb = -1;
-  long anon_kb = -1;  // of which heap, stacks and other private memory
-  long file_kb = -1;  // of which mapped files (code of the daemon and its libraries)
-  int descriptors = -1;
-  int threads = -1;
-};
-
-int count_entries(const std::string& dir_path) {
-  DIR* dir = opendir(dir_path.c_str());
-  if (dir == nullptr) return -1;
-  int n = 0;
-  while (struct dirent* e = readdir(dir)) {
-    if (e->d_name[0] != '.') ++n;
-  }
-  closedir(dir);
-  return n;
-}
-
-Usage usage_of(pid_t pid) {
-  Usage u;
-  const std::string proc = "/proc/" + std::to_string(pid);
-  std::ifstream status(proc + "/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind("VmRSS:", 0) == 0) u.rss_kb = atol(line.c_str() + 6);
-    if (line.rfind("RssAnon:", 0) == 0) u.anon_kb = atol(line.c_str() + 8);
-    if (line.rfind("RssFile:", 0) == 0) u.file_kb = atol(line.c_str() + 8);
-  }
-  u.descriptors = count_entries(proc + "/fd");
-  u.threads = count_entries(proc + "/task");
-  return u;
-}
-
-pid_t start_daemon(const Options& o, const std::map<std::string, std::string>& env, int* log_fd) {
-  int fds[2];
-  if (pipe2(fds, O_CLOEXEC) != 0) return -1;
-  std::vector<std::string> strings;
-  for (const auto& kv : env) strings.push_back(kv.first + "=" + kv.second);
-  std::vector<char*> envp;
-  for (std::string& s : strings) envp.push_back(s.data());
-  envp.push_back(nullptr);
-  std::vector<std::string> args;
-  if (o.valgrind) {
-    args = {"valgrind", "--leak-check=full", "--error-exitcode=1", "--log-file=" + o.valgrind_log};
-    if (!o.suppressions.empty()) args.push_back("--suppressions=" + o.suppressions);
-  }
-  args.push_back(o.daemon);
-  std::vector<char*> argv;
-  for (std::string& a : args) argv.push_back(a.data());
-  argv.push_back(nullptr);
-
-  const pid_t pid = fork();
-  if (pid == 0) {
-    dup2(fds[1], 2);
-    const int null = open("/dev/null", O_RDWR);
-    dup2(null, 0);
-    dup2(null, 1);
-    execvpe(argv[0], argv.data(), envp.data());
-    _exit(127);
-  }
-  close(fds[1]);
-  *log_fd = fds[0];
-  return pid;
-}
-
-// The exit status once the process has ended within the timeout (-signal when killed).
-bool wait_exit(pid_t pid, std::chrono::milliseconds timeout, int* status_out) {
-  const auto deadline = Clock::now() + timeout;
-  for (;;) {
-    int status = 0;
-    if (waitpid(pid, &status, WNOHANG) == pid) {
-      *status_out = WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status);
-      return true;
-    }
-    if (Clock::now() >= deadline) return false;
-    std::this_thread::sleep_for(10ms);
-  }
-}
-
-// ---------------------------------------------------------------------------------------------
 
 struct ValgrindSummary {
   bool found = false;
@@ -531,16 +349,8 @@ void Soak::report_failure(const std::string& what) {
 }
 
 bool Soak::prepare() {
-  char tmpl[] = "/tmp/kestrel-soak-XXXXXX";
-  if (mkdtemp(tmpl) == nullptr) return false;
-  dir_ = tmpl;
-  mkdir((dir_ + "/tools").c_str(), 0755);
-  mkdir((dir_ + "/root").c_str(), 0755);
-  for (const char* tool : {"chown", "chmod", "diag_mdlog"}) {
-    write_text(dir_ + "/tools/" + tool, "#!/bin/sh\nexit 0\n", 0755);
-  }
-  write_text(dir_ + "/properties", "");
-  return true;
+  dir_ = make_run_dir("kestrel-soak");
+  return !dir_.empty();
 }
 
 void Soak::send_commands(long count) {
@@ -608,25 +418,21 @@ int Soak::run() {
   std::atomic<bool> stop{false};
   std::thread receiver(receive_frames, kernel_fd_, &stop, &tally_);
 
-  std::map<std::string, std::string> env;
-  for (char** e = environ; *e != nullptr; ++e) {
-    const char* eq = strchr(*e, '=');
-    if (eq != nullptr) env[std::string(*e, static_cast<size_t>(eq - *e))] = eq + 1;
-  }
-  env["KESTREL_KERNEL_PORT"] = std::to_string(kKernelPort);
-  env["KESTREL_SENSOR1_SOCKET"] = socket_path;
-  env["KESTREL_PROPERTIES"] = dir_ + "/properties";
-  env["KESTREL_SYSROOT"] = dir_ + "/root";
+  const std::map<std::string, std::string> env =
+      daemon_environment(dir_, socket_path, o_.time_scale, o_.registry);
   char scale[32];
   snprintf(scale, sizeof scale, "%g", o_.time_scale);
-  env["KESTREL_TIME_SCALE"] = scale;
-  if (!o_.registry.empty()) env["KESTREL_SENSOR_REG"] = o_.registry;
-  env["PATH"] = dir_ + "/tools:" + env["PATH"];
   Options o = o_;
   if (o.valgrind && o.valgrind_log.empty()) o.valgrind_log = dir_ + "/valgrind.log";
 
+  std::vector<std::string> args;
+  if (o.valgrind) {
+    args = {"valgrind", "--leak-check=full", "--error-exitcode=1", "--log-file=" + o.valgrind_log};
+    if (!o.suppressions.empty()) args.push_back("--suppressions=" + o.suppressions);
+  }
+  args.push_back(o.daemon);
   int log_fd = -1;
-  pid_ = start_daemon(o, env, &log_fd);
+  pid_ = start_daemon(args, env, &log_fd);
   if (pid_ < 0) {
     fprintf(stderr, "soak: cannot start %s\n", o.daemon.c_str());
     return 2;
