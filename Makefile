@@ -2,7 +2,7 @@
 # missing through apt-get when run as root, and say what to install otherwise.
 BUILD ?= build
 
-.PHONY: all build deps test demo fuzz clean arm64-test bench soak
+.PHONY: all build deps test demo fuzz clean arm64-test bench soak chaos
 
 all: build
 
@@ -44,6 +44,14 @@ soak:
 	@cmake -S . -B $(BUILD) -G Ninja >/dev/null
 	@cmake --build $(BUILD) --target kestrel-soak
 	@scripts/soak.sh $(BUILD)
+
+# The chaos run: a seeded random schedule of link faults and commands for CHAOS_MINUTES (default
+# 5; CHAOS_SEED, CHAOS_TSAN_MINUTES), then a shorter run of the daemon built with ThreadSanitizer
+# (scripts/chaos.sh; figures in docs/reliability.md).
+chaos: deps
+	@cmake -S . -B $(BUILD) -G Ninja >/dev/null
+	@cmake --build $(BUILD) --target kestrel-chaos
+	@scripts/chaos.sh $(BUILD)
 
 clean:
 	rm -rf build build-*
