@@ -10,10 +10,12 @@
 // the connection it closes: it waits for that callback to return. A close on the library's own
 // thread (from inside a callback) goes through at once.
 //
-// Handles are never freed: a closed handle stays in the process-wide list, marked closed, so a
-// late call on it gets an error instead of touching freed memory. The file descriptor of a
-// connection is closed only by the library thread (or by the failed open that created it), never
-// while it may sit in the thread's poll set.
+// A handle is a number, not an address: the connection's slot and the generation of that slot,
+// so a late call on a closed handle gets an error instead of reaching whatever uses the slot
+// next. Connection records are never freed; a closed one whose descriptor is gone is used again
+// by a later open, so a daemon that reconnects for ever keeps a bounded set of them. The file
+// descriptor of a connection is closed only by the library thread (or by the failed open that
+// created it), never while it may sit in the thread's poll set.
 #include "sensor1.h"
 
 #include <android/log.h>
@@ -52,12 +54,10 @@ struct Fault {
   uint32_t count = 0;
 };
 
-}  // namespace
-
-struct sensor1_handle_s {
+struct Connection {
+  size_t slot = 0;  // its index in g_connections
   sensor1_notify_data_cb_t cb = nullptr;
   intptr_t cb_data = 0;
-  sensor1_handle_s* next = nullptr;  // process-wide list, never unlinked
 
   // Guarded by io_lock: the descriptor (-1 once closed) and every write to it, so records of
   // different threads never interleave and the descriptor is never closed under a writer.
@@ -65,6 +65,8 @@ struct sensor1_handle_s {
   int fd = -1;
 
   // Guarded by g_lock.
+  uint64_t generation = 0;  // opens of this record so far
+  bool reusable = false;    // closed and its descriptor closed: a later open may take it
   LinkState state = LinkState::kOpen;
   bool in_callback = false;  // the library thread is inside this connection's callback
   bool fd_to_close = false;  // closed or ended, descriptor still to be closed by the thread
@@ -74,13 +76,12 @@ struct sensor1_handle_s {
   std::vector<uint8_t> rx;
 };
 
-namespace {
-
 // Lock order: a handle's io_lock before g_lock.
 pthread_mutex_t g_lock = PTHREAD_MUTEX_INITIALIZER;
 pthread_cond_t g_callback_returned = PTHREAD_COND_INITIALIZER;  // with g_lock
 thread_local bool t_library_thread = false;
-sensor1_handle_s* g_handles = nullptr;  // guarded by g_lock
+// Guarded by g_lock; never freed, nor destroyed at exit while the library thread may use it.
+std::vector<Connection*>& g_connections = *new std::vector<Connection*>;
 pthread_once_t g_thread_once = PTHREAD_ONCE_INIT;
 int g_wake[2] = {-1, -1};  // pipe that wakes the library thread when the set changes
 bool g_thread_started = false;
@@ -109,7 +110,7 @@ void wake_thread() {
 }
 
 // Consumes one fault of op on h, if one is armed. Called with g_lock held.
-bool take_fault(sensor1_handle_s* h, FaultOp op, int* result) {
+bool take_fault(Connection* h, FaultOp op, int* result) {
   Fault& f = h->faults[static_cast<int>(op) - 1];
   if (f.count == 0) return false;
   --f.count;
@@ -129,7 +130,7 @@ const char* op_name(FaultOp op) {
 }
 
 // Runs h's callback on the library thread; a close of h waits until it has returned.
-void run_callback(sensor1_handle_s* h, sensor1_msg_header_s* hdr, int type, void* body) {
+void run_callback(Connection* h, sensor1_msg_header_s* hdr, int type, void* body) {
   pthread_mutex_lock(&g_lock);
   h->in_callback = true;
   pthread_mutex_unlock(&g_lock);
@@ -141,7 +142,7 @@ void run_callback(sensor1_handle_s* h, sensor1_msg_header_s* hdr, int type, void
 }
 
 // Sends one record on h under its io_lock. False when the connection is gone.
-bool send_record(sensor1_handle_s* h, const Record& rec) {
+bool send_record(Connection* h, const Record& rec) {
   const std::vector<uint8_t> bytes = sensor1_wire::encode(rec);
   pthread_mutex_lock(&h->io_lock);
   const bool ok = h->fd >= 0 && sensor1_wire::send_all(h->fd, bytes.data(), bytes.size());
@@ -151,7 +152,7 @@ bool send_record(sensor1_handle_s* h, const Record& rec) {
 
 // The connection ended without sensor1_close: it is dead from now on and its callback hears of
 // it once.
-void end_connection(sensor1_handle_s* h) {
+void end_connection(Connection* h) {
   pthread_mutex_lock(&g_lock);
   const bool report = h->state == LinkState::kOpen;
   if (report) {
@@ -167,7 +168,7 @@ void end_connection(sensor1_handle_s* h) {
   run_callback(h, &hdr, SENSOR1_MSG_TYPE_BROKEN_PIPE, nullptr);
 }
 
-bool is_open(sensor1_handle_s* h) {
+bool is_open(Connection* h) {
   pthread_mutex_lock(&g_lock);
   const bool open = h->state == LinkState::kOpen;
   pthread_mutex_unlock(&g_lock);
@@ -181,7 +182,7 @@ void* copy_body(const Record& rec) {
   return body;
 }
 
-void apply_fault(sensor1_handle_s* h, const Record& rec) {
+void apply_fault(Connection* h, const Record& rec) {
   if (rec.op >= 1 && rec.op <= kOpCount) {
     const FaultOp op = static_cast<FaultOp>(rec.op);
     pthread_mutex_lock(&g_lock);
@@ -197,7 +198,7 @@ void apply_fault(sensor1_handle_s* h, const Record& rec) {
 }
 
 // Hands one record of the simulator to h's callback (or applies it).
-void deliver(sensor1_handle_s* h, const Record& rec) {
+void deliver(Connection* h, const Record& rec) {
   sensor1_msg_header_s hdr;
   memset(&hdr, 0, sizeof hdr);
   hdr.service_number = rec.header.service;
@@ -228,7 +229,7 @@ void deliver(sensor1_handle_s* h, const Record& rec) {
 
 // Delivers every complete record in h->rx, stopping as soon as the connection is closed (by a
 // callback, or by another thread). False when the stream is malformed.
-bool deliver_buffered(sensor1_handle_s* h) {
+bool deliver_buffered(Connection* h) {
   size_t pos = 0;
   for (;;) {
     Record rec;
@@ -254,34 +255,63 @@ bool deliver_buffered(sensor1_handle_s* h) {
 }
 
 void close_retired_descriptors() {
-  std::vector<sensor1_handle_s*> retired;
+  std::vector<Connection*> retired;
   pthread_mutex_lock(&g_lock);
-  for (sensor1_handle_s* h = g_handles; h != nullptr; h = h->next) {
+  for (Connection* h : g_connections) {
     if (h->fd_to_close) {
       h->fd_to_close = false;
       retired.push_back(h);
     }
   }
   pthread_mutex_unlock(&g_lock);
-  for (sensor1_handle_s* h : retired) {
+  for (Connection* h : retired) {
     pthread_mutex_lock(&h->io_lock);
     if (h->fd >= 0) close(h->fd);
     h->fd = -1;
     pthread_mutex_unlock(&h->io_lock);
+    // Only this thread touches rx; the memory of a long-gone connection is given back.
+    std::vector<uint8_t>().swap(h->rx);
+    pthread_mutex_lock(&g_lock);
+    h->reusable = h->state == LinkState::kClosed;
+    pthread_mutex_unlock(&g_lock);
   }
+}
+
+// The handle of h: slot + 1 in the low 16 bits, the generation above. Called with g_lock held.
+sensor1_handle_s* handle_of(const Connection* h) {
+  return reinterpret_cast<sensor1_handle_s*>(static_cast<uintptr_t>(h->generation) << 16 |
+                                             (h->slot + 1));
+}
+
+// The connection of a handle still current, or null. Called with g_lock held.
+Connection* connection_of(sensor1_handle_s* handle) {
+  const uintptr_t v = reinterpret_cast<uintptr_t>(handle);
+  const size_t slot = (v & 0xffff) - 1;
+  if ((v & 0xffff) == 0 || slot >= g_connections.size()) return nullptr;
+  Connection* h = g_connections[slot];
+  return !h->reusable && h->generation == v >> 16 ? h : nullptr;
+}
+
+// The connection of a handle, looked up under g_lock; the caller checks again under g_lock that
+// the handle is still current before it acts (a record never goes away, but it may be reused).
+Connection* find_connection(sensor1_handle_s* handle) {
+  pthread_mutex_lock(&g_lock);
+  Connection* h = connection_of(handle);
+  pthread_mutex_unlock(&g_lock);
+  return h;
 }
 
 void* library_thread(void*) {
   t_library_thread = true;
   std::vector<pollfd> fds;
-  std::vector<sensor1_handle_s*> polled;
+  std::vector<Connection*> polled;
   for (;;) {
     close_retired_descriptors();
     fds.clear();
     polled.clear();
     fds.push_back({g_wake[0], POLLIN, 0});
     pthread_mutex_lock(&g_lock);
-    for (sensor1_handle_s* h = g_handles; h != nullptr; h = h->next) {
+    for (Connection* h : g_connections) {
       if (h->state != LinkState::kOpen) continue;
       // Only this thread closes descriptors, so h->fd is stable here without io_lock.
       fds.push_back({h->fd, POLLIN, 0});
@@ -298,7 +328,7 @@ void* library_thread(void*) {
     // Connections the callbacks below open are polled on the next pass.
     for (size_t i = 1; i < fds.size(); ++i) {
       if (fds[i].revents == 0) continue;
-      sensor1_handle_s* h = polled[i - 1];
+      Connection* h = polled[i - 1];
       if (!is_open(h)) continue;
       const int got = sensor1_wire::receive_available(fds[i].fd, &h->rx);
       if (got != 0 && (got < 0 || !deliver_buffered(h))) end_connection(h);
@@ -341,43 +371,61 @@ int sensor1_open(sensor1_handle_s** handle, sensor1_notify_data_cb_t cb, intptr_
     log_line("open -> %d", SENSOR1_HOST_EPIPE);
     return SENSOR1_HOST_EPIPE;
   }
-  sensor1_handle_s* h = new sensor1_handle_s;
+  pthread_mutex_lock(&g_lock);
+  Connection* h = nullptr;
+  for (Connection* c : g_connections) {
+    if (c->reusable) {
+      h = c;
+      break;
+    }
+  }
+  if (h == nullptr) {
+    h = new Connection;
+    h->slot = g_connections.size();
+    g_connections.push_back(h);
+  }
+  // A reused record: closed, its descriptor closed, out of the thread's poll set, no callback.
   h->cb = cb;
   h->cb_data = cb_data;
+  // Without its io_lock (taken before g_lock): a late caller checks the handle under g_lock
+  // before it touches the descriptor.
   h->fd = fd;
-  *handle = h;
-  log_line("open -> %d", SENSOR1_SUCCESS);
-  pthread_mutex_lock(&g_lock);
-  h->next = g_handles;
-  g_handles = h;
+  ++h->generation;
+  h->reusable = false;
+  h->state = LinkState::kOpen;
+  h->fd_to_close = false;
+  for (Fault& f : h->faults) f = Fault{};
+  *handle = handle_of(h);
   pthread_mutex_unlock(&g_lock);
+  log_line("open -> %d", SENSOR1_SUCCESS);
   wake_thread();
   return SENSOR1_SUCCESS;
 }
 
 int sensor1_close(sensor1_handle_s* handle) {
-  if (handle == nullptr) {
+  Connection* h = find_connection(handle);
+  if (h == nullptr) {
     log_line("close -> %d", SENSOR1_HOST_EINVAL);
     return SENSOR1_HOST_EINVAL;
   }
-  pthread_mutex_lock(&handle->io_lock);
+  pthread_mutex_lock(&h->io_lock);
   pthread_mutex_lock(&g_lock);
   int result = SENSOR1_SUCCESS;
   bool closed_now = false;
-  if (handle->state == LinkState::kClosed) {
+  if (connection_of(handle) != h || h->state == LinkState::kClosed) {
     result = SENSOR1_HOST_EINVAL;
   } else {
-    take_fault(handle, FaultOp::kClose, &result);
-    handle->fd_to_close = true;
-    handle->state = LinkState::kClosed;
+    take_fault(h, FaultOp::kClose, &result);
+    h->fd_to_close = true;
+    h->state = LinkState::kClosed;
     closed_now = true;
     // The simulator sees the end at once; the descriptor itself is closed by the thread.
-    if (handle->fd >= 0) shutdown(handle->fd, SHUT_RDWR);
+    if (h->fd >= 0) shutdown(h->fd, SHUT_RDWR);
   }
-  pthread_mutex_unlock(&handle->io_lock);
+  pthread_mutex_unlock(&h->io_lock);
   // No new callback starts on a closed connection; one already running is waited for, unless
   // this is that callback's own thread.
-  while (handle->in_callback && !t_library_thread) {
+  while (closed_now && h->in_callback && !t_library_thread) {
     pthread_cond_wait(&g_callback_returned, &g_lock);
   }
   pthread_mutex_unlock(&g_lock);
@@ -389,15 +437,15 @@ int sensor1_close(sensor1_handle_s* handle) {
 int sensor1_alloc_msg_buf(sensor1_handle_s* handle, uint16_t size, void** buf) {
   if (buf == nullptr) return SENSOR1_HOST_EINVAL;
   *buf = nullptr;
-  if (handle == nullptr) return SENSOR1_HOST_EINVAL;
   pthread_mutex_lock(&g_lock);
+  Connection* h = connection_of(handle);
   int result = SENSOR1_SUCCESS;
-  if (handle->state == LinkState::kClosed) {
+  if (h == nullptr || h->state == LinkState::kClosed) {
     result = SENSOR1_HOST_EINVAL;
-  } else if (handle->state == LinkState::kEnded) {
+  } else if (h->state == LinkState::kEnded) {
     result = SENSOR1_HOST_EPIPE;
   } else {
-    take_fault(handle, FaultOp::kAlloc, &result);
+    take_fault(h, FaultOp::kAlloc, &result);
   }
   pthread_mutex_unlock(&g_lock);
   if (result != SENSOR1_SUCCESS) return result;
@@ -413,30 +461,32 @@ int sensor1_free_msg_buf(sensor1_handle_s*, void* buf) {
 }
 
 int sensor1_write(sensor1_handle_s* handle, sensor1_msg_header_s* hdr, void* body) {
-  if (handle == nullptr || hdr == nullptr) return SENSOR1_HOST_EINVAL;
+  if (hdr == nullptr) return SENSOR1_HOST_EINVAL;
   if (body == nullptr && hdr->msg_size != 0) return SENSOR1_HOST_EINVAL;
+  Connection* h = find_connection(handle);
+  if (h == nullptr) return SENSOR1_HOST_EINVAL;
   const std::vector<uint8_t> rec = sensor1_wire::encode(sensor1_wire::message(
       sensor1_wire::kWrite, {hdr->service_number, hdr->msg_id, 0, hdr->txn_id},
       static_cast<const uint8_t*>(body), hdr->msg_size));
 
-  pthread_mutex_lock(&handle->io_lock);
+  pthread_mutex_lock(&h->io_lock);
   pthread_mutex_lock(&g_lock);
   int result = SENSOR1_SUCCESS;
   bool faulted = false;
-  if (handle->state == LinkState::kClosed) {
+  if (connection_of(handle) != h || h->state == LinkState::kClosed) {
     result = SENSOR1_HOST_EINVAL;
-  } else if (handle->state == LinkState::kEnded) {
+  } else if (h->state == LinkState::kEnded) {
     result = SENSOR1_HOST_EPIPE;
   } else {
-    faulted = take_fault(handle, FaultOp::kWrite, &result);
+    faulted = take_fault(h, FaultOp::kWrite, &result);
   }
   pthread_mutex_unlock(&g_lock);
   // A write faulted with EWOULDBLOCK still goes out and takes the body, like a success.
   const bool send = result == SENSOR1_SUCCESS || (faulted && result == SENSOR1_EWOULDBLOCK);
-  if (send && !(handle->fd >= 0 && sensor1_wire::send_all(handle->fd, rec.data(), rec.size()))) {
+  if (send && !(h->fd >= 0 && sensor1_wire::send_all(h->fd, rec.data(), rec.size()))) {
     result = SENSOR1_HOST_EPIPE;
   }
-  pthread_mutex_unlock(&handle->io_lock);
+  pthread_mutex_unlock(&h->io_lock);
   if (result == SENSOR1_SUCCESS || (faulted && result == SENSOR1_EWOULDBLOCK)) {
     release_body(body);
   }

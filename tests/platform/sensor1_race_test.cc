@@ -80,6 +80,7 @@ TEST(Sensor1Race, CloseRacesDeliveriesAndWritesWithoutHarm) {
   ASSERT_EQ(later.open(&h2), 0);
   sim.respond({0, 64, 0, 0}, {0});
   ASSERT_TRUE(later.wait_for(1));
+  EXPECT_EQ(write_request(h, {0, 64, 0, 0}, {1}), SENSOR1_HOST_EINVAL) << "not on the new one";
   EXPECT_EQ(closed_one.deliveries().size(), before);
   for (const Delivery& d : closed_one.deliveries()) EXPECT_NE(d.type, 250);
   EXPECT_EQ(sensor1_close(h2), 0);

@@ -5,6 +5,7 @@
 
 #include <dirent.h>
 #include <fcntl.h>
+#include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/stat.h>
@@ -54,6 +55,11 @@ std::string make_run_dir(const char* name) {
   }
   write_text(dir + "/properties", "");
   return dir;
+}
+
+void remove_run_dir(const std::string& dir) {
+  const std::string cmd = "rm -rf '" + dir + "'";
+  if (system(cmd.c_str()) != 0) fprintf(stderr, "could not remove %s\n", dir.c_str());
 }
 
 std::map<std::string, std::string> daemon_environment(const std::string& dir,

@@ -22,6 +22,9 @@ constexpr uint32_t kDaemonPort = 20000;
 // properties file and an empty root/. Empty on failure.
 std::string make_run_dir(const char* name);
 
+// Removes the directory and everything in it (a message on stderr when it cannot).
+void remove_run_dir(const std::string& dir);
+
 // This process's environment with the daemon's settings for a run in dir.
 std::map<std::string, std::string> daemon_environment(const std::string& dir,
                                                       const std::string& socket_path,

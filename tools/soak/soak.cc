@@ -578,8 +578,7 @@ int Soak::run() {
   printf("soak: %s\n", ok_ ? "PASS" : "FAIL");
   if (!ok_) report_failure("the soak missed");
   if (ok_ && o.valgrind_log.rfind(dir_, 0) != 0) {
-    std::string cmd = "rm -rf '" + dir_ + "'";
-    if (system(cmd.c_str()) != 0) fprintf(stderr, "soak: could not remove %s\n", dir_.c_str());
+    remove_run_dir(dir_);
   }
   return ok_ ? 0 : 1;
 }
