@@ -16,15 +16,19 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <climits>
+#include <memory>
 
 #include "byte_order.h"
 #include "diag/diag_logging.h"
 #include "kernel_channel/netlink_channel.h"
 #include "requests/raw_data.h"
+#include "sensor1_host.h"
 #include "service_link/connection.h"
 #include "service_link/factory_state.h"
 #include "service_link/response_waiter.h"
 #include "service_link/service_callback.h"
+#include "tools/sim/simulator.h"
 
 namespace kestrel_fuzz {
 
@@ -49,6 +53,7 @@ constexpr uint32_t kDaemonPort = 20000;
 constexpr size_t kHeaderSize = 16;
 
 fuzz_paths g_paths;
+kestrel_sim::Simulator* g_phone = nullptr;
 bool g_print_log = false;
 std::atomic<int> g_daemon_threads{0};
 std::atomic<int> g_failing_block{0};
@@ -218,7 +223,30 @@ const fuzz_paths& setup_fuzz_environment(const std::string& properties,
   init_callback_locks();
   init_response_waiters();
   set_kernel_channel(open("/dev/null", O_WRONLY | O_CLOEXEC));
+  // Lives as long as the process: the daemon's connections reach it to the end.
+  g_phone = new kestrel_sim::Simulator(kestrel_sim::Simulator::InProcess{}, true);
+  g_phone->phone().set_bad_request_hook([](const std::string& line) { fail("%s", line.c_str()); });
   return g_paths;
+}
+
+void set_phone_scenario(const phone_scenario& scenario) {
+  g_phone->clear_requests();
+  g_phone->refuse_opens(SENSOR1_EWOULDBLOCK, scenario.open_fails ? INT_MAX : 0);
+  g_phone->phone().set_knobs(scenario.knobs);
+  g_phone->set_connection_hook([scenario](kestrel_sim::Simulator& sim, int, bool opened) {
+    if (opened && scenario.alloc_result != 0) {
+      sim.fault(kestrel_sim::FaultOp::kAlloc, scenario.alloc_result, UINT32_MAX);
+    }
+    if (opened && scenario.write_result != 0) {
+      sim.fault(kestrel_sim::FaultOp::kWrite, scenario.write_result, UINT32_MAX);
+    }
+  });
+}
+
+void check_bodies_released() {
+  if (sensor1_host_outstanding_bodies() != 0) {
+    fail("%ld sensor1 bodies not released", sensor1_host_outstanding_bodies());
+  }
 }
 
 void reset_daemon_state(int32_t diag_state) {

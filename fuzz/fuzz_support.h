@@ -1,7 +1,9 @@
 // What every fuzz target shares: a private directory of KESTREL_* files set up before the
-// daemon's code first reads its environment, the interposed shell and log, the kernel channel
-// that swallows frames after checking them, and the reset of the daemon's process state between
-// inputs.
+// daemon's code first reads its environment, the phone (kestrel-sim's, reached in process on the
+// caller's thread, so a write's answers are in before it returns), the interposed shell and log,
+// the kernel channel that swallows frames after checking them, and the reset of the daemon's
+// process state between inputs. A request the daemon writes that breaks the phone's request
+// rules stops the run.
 //
 // Interposed in every fuzz binary:
 //   system()               returns 0 for the commands the daemon issues, so no shell ever runs
@@ -20,6 +22,8 @@
 
 #include <string>
 
+#include "tools/sim/healthy_phone.h"
+
 namespace kestrel_fuzz {
 
 // The files of one fuzz process, under a private temporary directory removed at exit.
@@ -35,6 +39,18 @@ struct fuzz_paths {
 // LLVMFuzzerInitialize, before any daemon or stand-in code runs.
 const fuzz_paths& setup_fuzz_environment(const std::string& properties,
                                          const std::string& registry);
+
+// How the phone and its sensor1 library behave for one input; the default is a healthy phone.
+struct phone_scenario {
+  bool open_fails = false;  // sensor1_open returns 11
+  int alloc_result = 0;     // non-zero: every sensor1_alloc_msg_buf returns it and no buffer
+  int write_result = 0;     // non-zero: every sensor1_write returns it (11: sent all the same)
+  kestrel_sim::PhoneKnobs knobs;
+};
+void set_phone_scenario(const phone_scenario& scenario);
+
+// Bodies of the sensor1 library not yet released; it must be 0 after every input.
+void check_bodies_released();
 
 // Replaces a file's contents.
 void write_file(const std::string& path, const void* data, size_t size);

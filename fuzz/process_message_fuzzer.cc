@@ -1,6 +1,7 @@
 // process_message on an arbitrary datagram of at most 1024 bytes, copied into a 1024-byte
 // receive buffer as the receive loop does. Every handler runs against the in-process sensor1
-// stand-in, which answers at once, the host registry (a calibrated phone's) and the host libdiag.
+// library reaching kestrel-sim's phone in process, which answers at once, the host registry (a
+// calibrated phone's) and the host libdiag.
 //
 // A DIAG dump (command 27) starts diag_logging_thread; the input waits for it to end.
 //
@@ -26,7 +27,6 @@
 #include <string.h>
 
 #include "fuzz_support.h"
-#include "inprocess_sensor1.h"
 #include "kernel_channel/process_message.h"
 
 #if defined(__has_feature)
@@ -58,22 +58,22 @@ uint32_t scenario_of(const uint8_t* data, size_t size) {
 void set_scenario(uint32_t s) {
   static const int32_t kDiagStates[4] = {0, 1, 3, 0};
   kestrel_fuzz::reset_daemon_state(kDiagStates[s & 3]);
-  kestrel_fuzz::sensor1_behaviour b;
-  b.alloc_fails = (s & (1u << 2)) != 0;
+  kestrel_fuzz::phone_scenario b;
+  b.alloc_result = (s & (1u << 2)) != 0 ? 12 : 0;
   if ((s & (1u << 3)) != 0) {
     b.write_result = 32;
   } else if ((s & (1u << 4)) != 0) {
     b.write_result = 11;
   }
   if ((s & (1u << 5)) != 0) {
-    b.outcome = kestrel_fuzz::test_outcome::kFailedWithCode;
+    b.knobs.outcome = kestrel_sim::TestOutcome::kFailedWithCode;
   } else if ((s & (1u << 6)) != 0) {
-    b.outcome = kestrel_fuzz::test_outcome::kFailedWithoutCode;
+    b.knobs.outcome = kestrel_sim::TestOutcome::kFailedWithoutCode;
   }
-  b.no_indications = (s & (1u << 7)) != 0;
+  b.knobs.no_indications = (s & (1u << 7)) != 0;
   b.open_fails = (s & (1u << 8)) != 0;
-  b.failed_responses = (s & (1u << 9)) != 0;
-  kestrel_fuzz::set_sensor1_behaviour(b);
+  b.knobs.failed_responses = (s & (1u << 9)) != 0;
+  kestrel_fuzz::set_phone_scenario(b);
   const int block = static_cast<int>((s >> 10) & 7);
   kestrel_fuzz::fail_frame_block(block <= 4 ? block : 0);
 }
@@ -101,8 +101,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   // Every request body went to the library or back to the allocator, every body the library
   // gave the callback was released.
   kestrel_fuzz::wait_for_daemon_threads();
-  if (kestrel_fuzz::outstanding_bodies() != 0) {
-    kestrel_fuzz::fail("%ld sensor1 bodies not released", kestrel_fuzz::outstanding_bodies());
-  }
+  kestrel_fuzz::check_bodies_released();
   return 0;
 }

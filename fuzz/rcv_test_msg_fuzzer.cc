@@ -1,6 +1,6 @@
 // rcv_test_msg, the service callback, on an arbitrary message: any message type, a header or
 // none, a body or none, of any size (shorter than every layout included). The body comes from the
-// in-process sensor1 stand-in's allocator with exactly its size, and msg_size is that size.
+// sensor1 library's allocator with exactly its size, and msg_size is that size.
 //
 // Input layout, little-endian (missing bytes read as 0):
 //   0   i32  message type (1 response, 2 indication, 250 broken pipe, 251 retry open, any other)
@@ -25,8 +25,8 @@
 #include <string>
 
 #include "fuzz_support.h"
-#include "inprocess_sensor1.h"
 #include "sensor1.h"
+#include "sensor1_host.h"
 #include "service_link/connection.h"
 #include "service_link/factory_state.h"
 #include "service_link/service_callback.h"
@@ -73,12 +73,12 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
 
   static const int32_t kDiagStates[4] = {0, 1, 3, 0};
   kestrel_fuzz::reset_daemon_state(kDiagStates[(state >> 1) & 3]);
-  kestrel_fuzz::set_sensor1_behaviour({});
+  kestrel_fuzz::set_phone_scenario({});
   if ((state & 1) != 0) get_handle_for_sensor(0);
   if ((state & 8) != 0) set_mag_sensitivity(1.0f, 1.0f, 1.0f);
-  kestrel_fuzz::sensor1_behaviour b;
+  kestrel_fuzz::phone_scenario b;
   b.open_fails = (state & 16) != 0;
-  kestrel_fuzz::set_sensor1_behaviour(b);
+  kestrel_fuzz::set_phone_scenario(b);
   set_properties((state & 32) != 0);
 
   sensor1_msg_header_s hdr;
@@ -89,7 +89,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
 
   void* body = nullptr;
   if (with_body) {
-    body = kestrel_fuzz::alloc_callback_body(body_size);
+    body = sensor1_host_alloc_body(body_size);
     if (body_size > 0) memcpy(body, body_bytes, body_size);
   }
   rcv_test_msg(sensor1_callback_data(), with_header ? &hdr : nullptr, msg_type, body);
@@ -97,8 +97,6 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   if (!with_header && body != nullptr) sensor1_free_msg_buf(nullptr, body);
 
   kestrel_fuzz::wait_for_daemon_threads();
-  if (kestrel_fuzz::outstanding_bodies() != 0) {
-    kestrel_fuzz::fail("%ld sensor1 bodies not released", kestrel_fuzz::outstanding_bodies());
-  }
+  kestrel_fuzz::check_bodies_released();
   return 0;
 }

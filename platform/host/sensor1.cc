@@ -10,6 +10,12 @@
 // the connection it closes: it waits for that callback to return. A close on the library's own
 // thread (from inside a callback) goes through at once.
 //
+// With sensor1_host::use_in_process_peer, connections reach a peer in this process instead, with
+// the same records and the same handle rules, and no library thread: what the peer sends is
+// delivered on the thread of the library call that made it send (a write's response and
+// indications before the write returns), or on the peer's own thread, one message at a time
+// across every connection.
+//
 // A handle is a number, not an address: the connection's slot and the generation of that slot,
 // so a late call on a closed handle gets an error instead of reaching whatever uses the slot
 // next. Connection records are never freed; a closed one whose descriptor is gone is used again
@@ -31,6 +37,8 @@
 #include <unistd.h>
 
 #include <atomic>
+#include <deque>
+#include <mutex>
 #include <vector>
 
 #include "host_env.h"
@@ -54,8 +62,27 @@ struct Fault {
   uint32_t count = 0;
 };
 
+struct Connection;
+
+// The far end's side of an in-process connection, one per connection record, used again with
+// it. Its fields are guarded by g_inbox_mu.
+class InProcessLink final : public sensor1_host::Link {
+ public:
+  explicit InProcessLink(Connection* c) : connection(c) {}
+  bool send(const uint8_t* record, size_t size) override;
+  void drop() override;
+
+  Connection* const connection;
+  sensor1_host::Peer* peer = nullptr;
+  bool opening = true;  // records wait until sensor1_open has returned
+  bool answered = false;
+  int32_t open_result = SENSOR1_EWOULDBLOCK;
+  bool ended = false;  // closed by the library or dropped by the peer
+};
+
 struct Connection {
-  size_t slot = 0;  // its index in g_connections
+  size_t slot = 0;                // its index in g_connections
+  InProcessLink* link = nullptr;  // set, for good, on a record of in-process connections
   sensor1_notify_data_cb_t cb = nullptr;
   intptr_t cb_data = 0;
 
@@ -76,7 +103,7 @@ struct Connection {
   std::vector<uint8_t> rx;
 };
 
-// Lock order: a handle's io_lock before g_lock.
+// Lock order: a handle's io_lock before g_inbox_mu before g_lock.
 pthread_mutex_t g_lock = PTHREAD_MUTEX_INITIALIZER;
 pthread_cond_t g_callback_returned = PTHREAD_COND_INITIALIZER;  // with g_lock
 thread_local bool t_library_thread = false;
@@ -87,12 +114,26 @@ int g_wake[2] = {-1, -1};  // pipe that wakes the library thread when the set ch
 bool g_thread_started = false;
 std::atomic<long> g_outstanding{0};
 
+// The in-process way: the peer new connections reach, and the records peers have sent, in
+// arrival order over every connection (an empty record is the end of its connection).
+std::atomic<sensor1_host::Peer*> g_peer{nullptr};
+struct Inbound {
+  Connection* connection;
+  uint64_t generation;
+  std::vector<uint8_t> record;
+};
+std::mutex g_inbox_mu;
+std::deque<Inbound> g_inbox;             // guarded by g_inbox_mu
+std::atomic<bool> g_delivering{false};   // a thread is delivering from g_inbox
+thread_local bool t_delivering = false;  // ... and it is this one
+
 void log_line(const char* fmt, int value) {
   __android_log_print(ANDROID_LOG_INFO, kTag, fmt, value);
 }
 
+// Exactly size bytes, so a read past a body is a read past its block.
 void* alloc_body(size_t size) {
-  void* p = calloc(1, size > 0 ? size : 1);
+  void* p = size > 0 ? calloc(1, size) : malloc(0);
   if (p != nullptr) g_outstanding.fetch_add(1);
   return p;
 }
@@ -141,9 +182,25 @@ void run_callback(Connection* h, sensor1_msg_header_s* hdr, int type, void* body
   pthread_mutex_unlock(&g_lock);
 }
 
-// Sends one record on h under its io_lock. False when the connection is gone.
+void deliver_inbox();
+
+bool link_open(Connection* h) {
+  std::lock_guard<std::mutex> lock(g_inbox_mu);
+  return !h->link->ended;
+}
+
+// Hands one record to h's peer, then delivers what it answered. False when the link has ended.
+bool send_in_process(Connection* h, const std::vector<uint8_t>& bytes) {
+  if (!link_open(h)) return false;
+  h->link->peer->receive(h->link, bytes.data(), bytes.size());
+  deliver_inbox();
+  return true;
+}
+
+// Sends one record on h (under its io_lock on a socket). False when the connection is gone.
 bool send_record(Connection* h, const Record& rec) {
   const std::vector<uint8_t> bytes = sensor1_wire::encode(rec);
+  if (h->link != nullptr) return send_in_process(h, bytes);
   pthread_mutex_lock(&h->io_lock);
   const bool ok = h->fd >= 0 && sensor1_wire::send_all(h->fd, bytes.data(), bytes.size());
   pthread_mutex_unlock(&h->io_lock);
@@ -345,6 +402,151 @@ void start_library_thread() {
   g_thread_started = true;
 }
 
+// A connection record for a new connection, of the socket or in process: a reusable one or a
+// new one. Called with g_lock held.
+Connection* claim_connection(sensor1_notify_data_cb_t cb, intptr_t cb_data, bool in_process) {
+  Connection* h = nullptr;
+  for (Connection* c : g_connections) {
+    if (c->reusable && (c->link != nullptr) == in_process) {
+      h = c;
+      break;
+    }
+  }
+  if (h == nullptr) {
+    h = new Connection;
+    h->slot = g_connections.size();
+    if (in_process) h->link = new InProcessLink(h);
+    g_connections.push_back(h);
+  }
+  // A reused record: closed, its descriptor closed, out of the thread's poll set, no callback.
+  h->cb = cb;
+  h->cb_data = cb_data;
+  ++h->generation;
+  h->reusable = false;
+  h->state = LinkState::kOpen;
+  h->fd_to_close = false;
+  for (Fault& f : h->faults) f = Fault{};
+  return h;
+}
+
+// Delivers g_inbox on this thread, unless another thread is at it (it delivers what was queued
+// here once its callback has returned). Within a callback, records sent meanwhile are delivered
+// at once.
+void deliver_inbox() {
+  const bool outer = !t_delivering;
+  bool idle = false;
+  if (outer && !g_delivering.compare_exchange_strong(idle, true)) return;
+  const bool was_library_thread = t_library_thread;
+  t_delivering = true;
+  t_library_thread = true;  // a close from inside the callback goes through
+  for (;;) {
+    Inbound next;
+    {
+      std::lock_guard<std::mutex> lock(g_inbox_mu);
+      if (g_inbox.empty()) break;
+      next = std::move(g_inbox.front());
+      g_inbox.pop_front();
+    }
+    Connection* h = next.connection;
+    pthread_mutex_lock(&g_lock);
+    const bool current = h->generation == next.generation && !h->reusable;
+    pthread_mutex_unlock(&g_lock);
+    Record rec;
+    if (!current) continue;
+    if (next.record.empty() || sensor1_wire::parse(next.record.data(), next.record.size(), &rec) !=
+                                   static_cast<long>(next.record.size())) {
+      end_connection(h);
+    } else if (is_open(h)) {
+      deliver(h, rec);
+    }
+  }
+  if (!outer) return;
+  t_delivering = false;
+  t_library_thread = was_library_thread;
+  g_delivering.store(false);
+  // A record queued while the flag was still set has nobody else to deliver it.
+  bool more;
+  {
+    std::lock_guard<std::mutex> lock(g_inbox_mu);
+    more = !g_inbox.empty();
+  }
+  if (more) deliver_inbox();
+}
+
+// Queues a record (or, empty, the end) of h's current connection. Called with g_inbox_mu held.
+void queue_inbound(Connection* h, std::vector<uint8_t> record) {
+  pthread_mutex_lock(&g_lock);
+  const uint64_t generation = h->generation;
+  pthread_mutex_unlock(&g_lock);
+  g_inbox.push_back({h, generation, std::move(record)});
+}
+
+bool InProcessLink::send(const uint8_t* record, size_t size) {
+  {
+    std::lock_guard<std::mutex> lock(g_inbox_mu);
+    if (ended) return false;
+    Record rec;
+    if (opening && !answered && sensor1_wire::parse(record, size, &rec) > 0 &&
+        rec.kind == sensor1_wire::kOpenResult) {
+      answered = true;
+      open_result = rec.value;
+      return true;
+    }
+    queue_inbound(connection, std::vector<uint8_t>(record, record + size));
+    if (opening) return true;
+  }
+  deliver_inbox();
+  return true;
+}
+
+void InProcessLink::drop() {
+  {
+    std::lock_guard<std::mutex> lock(g_inbox_mu);
+    if (ended) return;
+    ended = true;
+    queue_inbound(connection, {});
+    if (opening) return;
+  }
+  deliver_inbox();
+}
+
+// sensor1_open with the peer: the OPEN handshake within the peer's receive.
+int open_in_process(sensor1_host::Peer* peer, sensor1_handle_s** handle,
+                    sensor1_notify_data_cb_t cb, intptr_t cb_data) {
+  pthread_mutex_lock(&g_lock);
+  Connection* h = claim_connection(cb, cb_data, true);
+  pthread_mutex_unlock(&g_lock);
+  InProcessLink* link = h->link;
+  {
+    std::lock_guard<std::mutex> lock(g_inbox_mu);
+    link->peer = peer;
+    link->opening = true;
+    link->answered = false;
+    link->ended = false;
+  }
+  const std::vector<uint8_t> open = sensor1_wire::encode(sensor1_wire::plain(sensor1_wire::kOpen));
+  peer->receive(link, open.data(), open.size());
+  int32_t result;
+  {
+    std::lock_guard<std::mutex> lock(g_inbox_mu);
+    link->opening = false;
+    result = link->answered ? link->open_result : SENSOR1_EWOULDBLOCK;
+    if (result != SENSOR1_SUCCESS) link->ended = true;
+  }
+  log_line("open -> %d", result);
+  pthread_mutex_lock(&g_lock);
+  if (result != SENSOR1_SUCCESS) {
+    h->state = LinkState::kClosed;
+    h->reusable = true;  // what it had queued is of a generation gone
+  } else {
+    *handle = handle_of(h);
+  }
+  pthread_mutex_unlock(&g_lock);
+  if (result != SENSOR1_SUCCESS) return result;
+  deliver_inbox();
+  return SENSOR1_SUCCESS;
+}
+
 }  // namespace
 
 extern "C" {
@@ -358,6 +560,8 @@ int sensor1_open(sensor1_handle_s** handle, sensor1_notify_data_cb_t cb, intptr_
     log_line("open -> %d", SENSOR1_HOST_EINVAL);
     return SENSOR1_HOST_EINVAL;
   }
+  sensor1_host::Peer* peer = g_peer.load();
+  if (peer != nullptr) return open_in_process(peer, handle, cb, cb_data);
   int32_t result = 0;
   const int fd = sensor1_wire::connect_and_open(host_environment().sensor1_socket,
                                                 kHandshakeTimeoutSeconds, &result);
@@ -372,29 +576,10 @@ int sensor1_open(sensor1_handle_s** handle, sensor1_notify_data_cb_t cb, intptr_
     return SENSOR1_HOST_EPIPE;
   }
   pthread_mutex_lock(&g_lock);
-  Connection* h = nullptr;
-  for (Connection* c : g_connections) {
-    if (c->reusable) {
-      h = c;
-      break;
-    }
-  }
-  if (h == nullptr) {
-    h = new Connection;
-    h->slot = g_connections.size();
-    g_connections.push_back(h);
-  }
-  // A reused record: closed, its descriptor closed, out of the thread's poll set, no callback.
-  h->cb = cb;
-  h->cb_data = cb_data;
+  Connection* h = claim_connection(cb, cb_data, false);
   // Without its io_lock (taken before g_lock): a late caller checks the handle under g_lock
   // before it touches the descriptor.
   h->fd = fd;
-  ++h->generation;
-  h->reusable = false;
-  h->state = LinkState::kOpen;
-  h->fd_to_close = false;
-  for (Fault& f : h->faults) f = Fault{};
   *handle = handle_of(h);
   pthread_mutex_unlock(&g_lock);
   log_line("open -> %d", SENSOR1_SUCCESS);
@@ -429,7 +614,20 @@ int sensor1_close(sensor1_handle_s* handle) {
     pthread_cond_wait(&g_callback_returned, &g_lock);
   }
   pthread_mutex_unlock(&g_lock);
-  if (closed_now) wake_thread();
+  bool tell_peer = false;
+  if (closed_now && h->link != nullptr) {
+    {
+      std::lock_guard<std::mutex> lock(g_inbox_mu);  // taken before g_lock, never after
+      tell_peer = !h->link->ended;
+      h->link->ended = true;
+    }
+    // In process there is no descriptor: the record may be used again at once.
+    pthread_mutex_lock(&g_lock);
+    h->reusable = true;
+    pthread_mutex_unlock(&g_lock);
+  }
+  if (closed_now && h->link == nullptr) wake_thread();
+  if (tell_peer) h->link->peer->closed(h->link);
   log_line("close -> %d", result);
   return result;
 }
@@ -483,13 +681,16 @@ int sensor1_write(sensor1_handle_s* handle, sensor1_msg_header_s* hdr, void* bod
   pthread_mutex_unlock(&g_lock);
   // A write faulted with EWOULDBLOCK still goes out and takes the body, like a success.
   const bool send = result == SENSOR1_SUCCESS || (faulted && result == SENSOR1_EWOULDBLOCK);
-  if (send && !(h->fd >= 0 && sensor1_wire::send_all(h->fd, rec.data(), rec.size()))) {
+  if (send && h->link != nullptr
+          ? !link_open(h)
+          : send && !(h->fd >= 0 && sensor1_wire::send_all(h->fd, rec.data(), rec.size()))) {
     result = SENSOR1_HOST_EPIPE;
   }
   pthread_mutex_unlock(&h->io_lock);
-  if (result == SENSOR1_SUCCESS || (faulted && result == SENSOR1_EWOULDBLOCK)) {
-    release_body(body);
-  }
+  const bool taken = result == SENSOR1_SUCCESS || (faulted && result == SENSOR1_EWOULDBLOCK);
+  if (taken) release_body(body);
+  // In process the peer answers now, on this thread, with no lock of the library held.
+  if (taken && h->link != nullptr) send_in_process(h, rec);
   return result;
 }
 
@@ -502,3 +703,7 @@ long sensor1_host_outstanding_bodies(void) {
 }
 
 }  // extern "C"
+
+void sensor1_host::use_in_process_peer(Peer* peer) {
+  g_peer.store(peer);
+}

@@ -167,11 +167,11 @@ std::vector<uint8_t> register_dump(uint8_t txn) {
   return r;
 }
 
-std::vector<uint8_t> sensor_state_table() {
-  std::vector<uint8_t> b = common_response_body(0, 0, kSensorStateResponseSize);
+void fill_sensor_state_table(std::vector<uint8_t>* table) {
+  uint8_t* b = table->data();
   const uint8_t ids[] = {kSmgrAccel, kSmgrGyro, kSmgrMag, kSmgrPressure, kSmgrLight, kSmgrId60};
   for (size_t i = 0; i < kStateRecordCount; ++i) {
-    uint8_t* rec = b.data() + kStateRecordsOffset + i * kStateRecordSize;
+    uint8_t* rec = b + kStateRecordsOffset + i * kStateRecordSize;
     if (i >= sizeof ids) {
       rec[0] = 255;  // empty
       continue;
@@ -184,7 +184,37 @@ std::vector<uint8_t> sensor_state_table() {
     rec[12] = 0x01;  // powered
     rec[13] = 0x00;  // no fault
   }
-  return b;
+}
+
+// The rules of the requests the daemon writes: each message's exact size and its txn ids.
+bool follows_rules(const Request& req) {
+  const std::vector<uint8_t>& b = req.body;
+  const size_t size = b.size();
+  const unsigned txn = req.header.txn_id;
+  if (size != req.header.msg_size) return false;
+  if (req.header.service == kServiceSmgr) {
+    switch (req.header.msg_id) {
+      case kMsgSmgrReport:
+        return size == kReportRequestSize && txn == kTxnReport;
+      case kMsgSmgrStatus:
+        return size == 3 && txn == kTxnStatus;
+      case kMsgSmgrSingleSensorTest:
+        return size == sizeof(single_sensor_test_request) && txn == kTxnSingleSensorTest &&
+               b[1] == 0;
+      case kMsgSmgrCalReset:
+        return size == 3 && txn == kTxnSingleSensorTest;
+      case kMsgSmgrSensorState:
+        return size == 1 && txn == kTxnSensorState && b[0] == 0xAA;
+      default:
+        return false;
+    }
+  }
+  return req.header.service == kServiceDaf && req.header.msg_id == kMsgDafRequest &&
+         size == sizeof(daf_request) &&
+         (txn == kTxnMotor || txn == kTxnDaf ||
+          (txn >= kTxnThreshold && txn <= kTxnRegisterDumpLast)) &&
+         b[offsetof(daf_request, flag)] == 1 && b[offsetof(daf_request, trailing_flag)] == 0 &&
+         load_u32(b.data(), offsetof(daf_request, data_length)) <= kDafDataMax;
 }
 
 const char* test_name(int32_t test_type, bool calibration) {
@@ -247,38 +277,92 @@ bool is_calibration(const std::vector<uint8_t>& body) {
 
 HealthyPhone::HealthyPhone(Simulator& sim) : sim_(sim) {}
 
+void HealthyPhone::set_knobs(const PhoneKnobs& knobs) {
+  std::lock_guard<std::mutex> lock(mu_);
+  knobs_ = knobs;
+}
+
+void HealthyPhone::set_single_samples(bool single) {
+  std::lock_guard<std::mutex> lock(mu_);
+  single_samples_ = single;
+}
+
+void HealthyPhone::set_bad_request_hook(std::function<void(const std::string&)> hook) {
+  std::lock_guard<std::mutex> lock(mu_);
+  bad_request_hook_ = std::move(hook);
+}
+
+uint64_t HealthyPhone::bad_requests() const {
+  std::lock_guard<std::mutex> lock(mu_);
+  return bad_requests_;
+}
+
+void HealthyPhone::check(const Request& req) {
+  if (follows_rules(req)) return;
+  std::function<void(const std::string&)> hook;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    ++bad_requests_;
+    hook = bad_request_hook_;
+  }
+  const std::string line = "request breaks the rules: " + describe_request(req);
+  if (hook) {
+    hook(line);
+  } else {
+    fprintf(stderr, "kestrel-sim: %s\n", line.c_str());
+  }
+}
+
+std::vector<uint8_t> HealthyPhone::response(size_t size) const {
+  std::lock_guard<std::mutex> lock(mu_);
+  return knobs_.failed_responses ? common_response_body(1, 3, size)
+                                 : common_response_body(0, 0, size);
+}
+
 HealthyPhone::~HealthyPhone() {
   stop();
 }
 
 void HealthyPhone::answer(const Request& req) {
+  check(req);
+  PhoneKnobs knobs;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    knobs = knobs_;
+  }
+  const bool failed = knobs.outcome != TestOutcome::kPassed;
+  const bool with_code = knobs.outcome == TestOutcome::kFailedWithCode;
   const std::vector<uint8_t>& body = req.body;
   const Header resp{req.header.service, req.header.msg_id, 0, req.header.txn_id};
   const int conn = req.connection;
 
   if (req.header.service == kServiceSmgr) {
     switch (req.header.msg_id) {
-      case kMsgSmgrSensorState:
-        sim_.respond_to(conn, resp, sensor_state_table());
+      case kMsgSmgrSensorState: {
+        std::vector<uint8_t> table = response(kSensorStateResponseSize);
+        fill_sensor_state_table(&table);
+        sim_.respond_to(conn, resp, table);
         return;
+      }
       case kMsgSmgrStatus: {
-        sim_.respond_to(conn, resp, common_response_body(0, 0, 3));
+        sim_.respond_to(conn, resp, response(3));
         const uint8_t id = byte_at(body, 0);
         // A sensor that answers its status poll reports a finished test of type 3.
-        if (known_test_sensor(id)) {
+        if (known_test_sensor(id) && !knobs.no_indications) {
           sim_.indicate_to(conn, {kServiceSmgr, kMsgSmgrSingleSensorTest, 0, req.header.txn_id},
-                           test_indication_body(id, 3, 0, 0, 0, {}));
+                           test_indication_body(id, 3, failed, with_code, with_code ? 7 : 0, {}));
         }
         return;
       }
       case kMsgSmgrSingleSensorTest: {
-        sim_.respond_to(conn, resp, common_response_body(0, 0));
+        sim_.respond_to(conn, resp, response(2));
         const uint8_t id = byte_at(body, 0);
         const int32_t test_type = static_cast<int32_t>(u32_at(body, 4));
         const auto words = test_words(id, test_type, is_calibration(body));
-        if (words) {
-          sim_.indicate_to(conn, {kServiceSmgr, kMsgSmgrSingleSensorTest, 0, req.header.txn_id},
-                           test_indication_body(id, test_type, 0, 0, 0, *words));
+        if (words && !knobs.no_indications) {
+          sim_.indicate_to(
+              conn, {kServiceSmgr, kMsgSmgrSingleSensorTest, 0, req.header.txn_id},
+              test_indication_body(id, test_type, failed, with_code, with_code ? 7 : 0, *words));
         }
         return;
       }
@@ -297,10 +381,10 @@ void HealthyPhone::answer(const Request& req) {
           s.sensor = sensor;
           s.period = std::chrono::microseconds(1000000 / rate);
           // Samples follow the response that accepted the report.
-          std::vector<uint8_t> r = common_response_body(0, 0, kReportResponseSize);
+          std::vector<uint8_t> r = response(kReportResponseSize);
           r[kReportRespSensorIdOffset] = sensor;
           sim_.respond_to(conn, resp, r);
-          start_stream(s);
+          if (!knobs.no_indications) start_stream(s);
           return;
         } else if (action == kReportActionDelete) {
           // The delete request names only the report; the answer names its sensor.
@@ -315,7 +399,7 @@ void HealthyPhone::answer(const Request& req) {
           stop_stream(conn, kServiceSmgr, report_id);
         }
         // A stopped stream sends nothing after this response.
-        std::vector<uint8_t> r = common_response_body(0, 0, kReportResponseSize);
+        std::vector<uint8_t> r = response(kReportResponseSize);
         r[kReportRespSensorIdOffset] = sensor;
         sim_.respond_to(conn, resp, r);
         return;
@@ -325,7 +409,7 @@ void HealthyPhone::answer(const Request& req) {
     }
   } else if (req.header.service == kServiceDaf && req.header.msg_id == kMsgDafRequest) {
     const uint32_t id = u32_at(body, offsetof(daf_request, daf_request_id));
-    std::vector<uint8_t> r = common_response_body(0, 0, kDafResponseSize);
+    std::vector<uint8_t> r = response(kDafResponseSize);
     Stream s;
     s.connection = conn;
     s.service = kServiceDaf;
@@ -362,13 +446,23 @@ void HealthyPhone::answer(const Request& req) {
         break;
     }
     sim_.respond_to(conn, resp, r);
-    if (s.key != 0) start_stream(s);  // polling results follow the response
+    if (s.key != 0 && !knobs.no_indications) start_stream(s);  // results follow the response
     return;
   }
-  sim_.respond_to(conn, resp, common_response_body(0, 0));
+  sim_.respond_to(conn, resp, response(2));
 }
 
 void HealthyPhone::start_stream(const Stream& stream) {
+  bool single;
+  {
+    std::lock_guard<std::mutex> lock(mu_);
+    single = single_samples_;
+  }
+  if (single) {
+    Stream once = stream;
+    send_sample(once);
+    return;
+  }
   remove_streams([&](const Stream& s) {
     return s.connection == stream.connection && s.service == stream.service && s.key == stream.key;
   });

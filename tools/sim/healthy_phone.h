@@ -3,10 +3,15 @@
 // still gyroscope, the earth's field on the magnetometer, sea-level air pressure, passing self
 // tests). Streams started by a report request or a light-sensor polling request send their
 // indications from a thread of their own until they are stopped or their connection ends.
+//
+// Knobs make it a faulty phone instead. Every request is checked against what the daemon may
+// send: a known service and message id, that message's exact body size and a known transaction
+// id; one that breaks the rules is reported (on stderr unless a hook is set) and still answered.
 #pragma once
 
 #include <chrono>
 #include <condition_variable>
+#include <functional>
 #include <mutex>
 #include <string>
 #include <thread>
@@ -15,6 +20,19 @@
 #include "tools/sim/simulator.h"
 
 namespace kestrel_sim {
+
+enum class TestOutcome {
+  kPassed,             // result 0, the sensor's words
+  kFailedWithCode,     // result 1, error valid, error code 7
+  kFailedWithoutCode,  // result 1, no error code
+};
+
+// What the phone gets wrong; the default is a healthy phone.
+struct PhoneKnobs {
+  bool failed_responses = false;  // every response carries result 1, error 3
+  bool no_indications = false;    // tests and streams indicate nothing
+  TestOutcome outcome = TestOutcome::kPassed;
+};
 
 class HealthyPhone {
  public:
@@ -34,6 +52,14 @@ class HealthyPhone {
 
   // Number of streams running (for tests and the program's status line).
   size_t stream_count() const;
+
+  void set_knobs(const PhoneKnobs& knobs);
+  // A stream start sends one sample at once, after its response, and no stream runs.
+  void set_single_samples(bool single);
+  // Called with a line about each request that breaks the rules, instead of printing it.
+  void set_bad_request_hook(std::function<void(const std::string&)> hook);
+  // Requests that broke the rules, over the phone's life.
+  uint64_t bad_requests() const;
 
  private:
   struct Stream {
@@ -65,6 +91,13 @@ class HealthyPhone {
   uint64_t next_id_ = 1;
   bool stopping_ = false;
   std::thread thread_;
+  PhoneKnobs knobs_;
+  bool single_samples_ = false;
+  std::function<void(const std::string&)> bad_request_hook_;
+  uint64_t bad_requests_ = 0;
+
+  void check(const Request& request);
+  std::vector<uint8_t> response(size_t size) const;
 };
 
 // One readable line about a request, e.g.

@@ -20,6 +20,7 @@
 #include <thread>
 
 #include "byte_order.h"
+#include "sensor1_host.h"
 #include "tools/sim/healthy_phone.h"
 
 namespace kestrel_sim {
@@ -30,9 +31,11 @@ namespace {
 constexpr Millis kSendTimeout(5000);
 
 struct Conn {
-  explicit Conn(int socket) : fd(socket) {}
+  explicit Conn(int socket, sensor1_host::Link* in_process = nullptr)
+      : fd(socket), link(in_process) {}
   std::mutex write_mu;  // guards fd: every send, and its closing
   int fd;
+  sensor1_host::Link* const link;  // an in-process connection's, instead of fd
   // Guarded by State::mu.
   int number = 0;  // set when the OPEN handshake succeeds
   bool ended = false;
@@ -77,7 +80,7 @@ bool send_with_timeout(int fd, const std::vector<uint8_t>& data, Millis timeout)
 
 }  // namespace
 
-struct Simulator::State {
+struct Simulator::State final : sensor1_host::Peer {
   explicit State(Simulator* owner, std::string socket_path, bool healthy_phone)
       : self(owner), path(std::move(socket_path)), healthy(healthy_phone), phone(*owner) {}
 
@@ -149,6 +152,8 @@ struct Simulator::State {
 
   bool send_to(const ConnPtr& c, const std::vector<uint8_t>& rec) {
     if (c == nullptr) return false;
+    // In process the record may reach the callback at once, which may write again: no lock.
+    if (c->link != nullptr) return c->link->send(rec.data(), rec.size());
     std::lock_guard<std::mutex> lock(c->write_mu);
     return c->fd >= 0 && send_with_timeout(c->fd, rec, kSendTimeout);
   }
@@ -186,10 +191,15 @@ struct Simulator::State {
       }
       const std::vector<uint8_t> rec =
           sensor1_wire::encode(sensor1_wire::result(sensor1_wire::kOpenResult, result));
-      sent = c->fd >= 0 && send_with_timeout(c->fd, rec, kSendTimeout);
+      sent = c->link != nullptr ? c->link->send(rec.data(), rec.size())
+                                : c->fd >= 0 && send_with_timeout(c->fd, rec, kSendTimeout);
     }
     if (!sent || result != 0) {
-      mark_ended(c);
+      if (c->link != nullptr) {
+        end_in_process(c);
+      } else {
+        mark_ended(c);
+      }
       return;
     }
     cv.notify_all();
@@ -216,6 +226,25 @@ struct Simulator::State {
     if (answer) phone.answer(req);
   }
 
+  void handle_record(const ConnPtr& c, const sensor1_wire::Record& rec) {
+    switch (rec.kind) {
+      case sensor1_wire::kOpen:
+        handle_open(c);
+        break;
+      case sensor1_wire::kWrite:
+        handle_write(c, rec);
+        break;
+      case sensor1_wire::kFaultAck: {
+        std::lock_guard<std::mutex> lock(mu);
+        ++c->fault_acks;
+        cv.notify_all();
+        break;
+      }
+      default:
+        break;
+    }
+  }
+
   // Handles every complete record in c->rx. False on a malformed stream.
   bool handle_records(const ConnPtr& c) {
     size_t pos = 0;
@@ -224,26 +253,47 @@ struct Simulator::State {
       const long span = sensor1_wire::parse(c->rx.data() + pos, c->rx.size() - pos, &rec);
       if (span < 0) return false;
       if (span == 0) break;
-      switch (rec.kind) {
-        case sensor1_wire::kOpen:
-          handle_open(c);
-          break;
-        case sensor1_wire::kWrite:
-          handle_write(c, rec);
-          break;
-        case sensor1_wire::kFaultAck: {
-          std::lock_guard<std::mutex> lock(mu);
-          ++c->fault_acks;
-          cv.notify_all();
-          break;
-        }
-        default:
-          break;
-      }
+      handle_record(c, rec);
       pos += static_cast<size_t>(span);
     }
     c->rx.erase(c->rx.begin(), c->rx.begin() + static_cast<long>(pos));
     return true;
+  }
+
+  // In process: the connection of a link, a new one for its OPEN.
+  ConnPtr in_process_conn(sensor1_host::Link* link, bool open) {
+    std::lock_guard<std::mutex> lock(mu);
+    for (const ConnPtr& c : conns) {
+      if (c->link == link) return c;
+    }
+    if (!open) return nullptr;
+    conns.push_back(std::make_shared<Conn>(-1, link));
+    return conns.back();
+  }
+
+  void receive(sensor1_host::Link* link, const uint8_t* record, size_t size) override {
+    sensor1_wire::Record rec;
+    const bool whole = sensor1_wire::parse(record, size, &rec) == static_cast<long>(size);
+    const ConnPtr c = in_process_conn(link, whole && rec.kind == sensor1_wire::kOpen);
+    if (c != nullptr && whole) handle_record(c, rec);
+  }
+
+  void closed(sensor1_host::Link* link) override {
+    const ConnPtr c = in_process_conn(link, false);
+    if (c != nullptr) end_in_process(c);
+  }
+
+  // An in-process connection has ended: it goes at once, with its hook.
+  void end_in_process(const ConnPtr& c) {
+    ConnectionHook hook;
+    {
+      std::lock_guard<std::mutex> lock(mu);
+      c->ended = true;
+      conns.erase(std::remove(conns.begin(), conns.end(), c), conns.end());
+      if (c->number != 0) hook = connection_hook;
+    }
+    cv.notify_all();
+    if (hook) hook(*self, c->number, false);
   }
 
   // Closes what was retired since the last pass: listening sockets and ended connections.
@@ -331,7 +381,24 @@ Simulator::Simulator(std::string socket_path, bool healthy)
   state_->io_id = state_->io.get_id();
 }
 
+Simulator::Simulator(InProcess, bool healthy) : state_(std::make_unique<State>(this, "", healthy)) {
+  state_->phone.set_single_samples(true);
+  sensor1_host::use_in_process_peer(state_.get());
+}
+
 Simulator::~Simulator() {
+  if (state_->path.empty()) {
+    // In process: new opens go to the socket again, and the library hears that every
+    // connection of this simulator has ended.
+    sensor1_host::use_in_process_peer(nullptr);
+    std::vector<ConnPtr> conns;
+    {
+      std::lock_guard<std::mutex> lock(state_->mu);
+      conns.swap(state_->conns);
+      state_->current.reset();
+    }
+    for (const ConnPtr& c : conns) c->link->drop();
+  }
   {
     std::lock_guard<std::mutex> lock(state_->mu);
     state_->stopping = true;
@@ -365,6 +432,10 @@ Simulator::~Simulator() {
 
 const std::string& Simulator::socket_path() const {
   return state_->path;
+}
+
+HealthyPhone& Simulator::phone() {
+  return state_->phone;
 }
 
 void Simulator::set_healthy(bool healthy) {
@@ -504,6 +575,7 @@ bool Simulator::fault(FaultOp op, int32_t result, uint32_t count, Millis timeout
   rec.op = static_cast<uint8_t>(op);
   rec.count = count;
   if (!state_->send_to(c, sensor1_wire::encode(rec))) return false;
+  if (c->link != nullptr) return true;  // applied before the library call in progress returns
   std::unique_lock<std::mutex> lock(state_->mu);
   return state_->cv.wait_for(lock, timeout, [&] { return c->fault_acks > before; });
 }
@@ -511,6 +583,11 @@ bool Simulator::fault(FaultOp op, int32_t result, uint32_t count, Millis timeout
 void Simulator::drop_connection() {
   const ConnPtr c = state_->current_conn();
   if (c == nullptr) return;
+  if (c->link != nullptr) {
+    state_->end_in_process(c);
+    c->link->drop();
+    return;
+  }
   {
     std::lock_guard<std::mutex> lock(c->write_mu);
     if (c->fd >= 0) shutdown(c->fd, SHUT_RDWR);

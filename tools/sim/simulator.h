@@ -30,11 +30,19 @@ struct Request {
 
 using Millis = std::chrono::milliseconds;
 
+class HealthyPhone;
+
 class Simulator {
  public:
   // Listens on socket_path (a stale file is removed). With healthy set it answers every request
   // like a healthy phone (see healthy_phone.h); without it, only what a test tells it.
   explicit Simulator(std::string socket_path, bool healthy = false);
+  // In process: from now on sensor1_open reaches this simulator in this process, on the caller's
+  // thread (sensor1_host::use_in_process_peer), until it is destroyed. There is no socket and no
+  // thread: a write gets its answers before it returns, fault() is applied before the library
+  // call in progress returns and waits for nothing, and a stream sends one sample at its start.
+  struct InProcess {};
+  Simulator(InProcess, bool healthy = false);
   ~Simulator();  // stops its threads, closes every connection and removes the socket file
   Simulator(const Simulator&) = delete;
   Simulator& operator=(const Simulator&) = delete;
@@ -42,6 +50,8 @@ class Simulator {
   const std::string& socket_path() const;
 
   void set_healthy(bool healthy);
+  // The phone that answers when healthy is set: its knobs and its count of bad requests.
+  HealthyPhone& phone();
 
   // The next count OPEN records are answered with result (11 EWOULDBLOCK, or any error code).
   void refuse_opens(int32_t result, int count);
