@@ -18,11 +18,10 @@
 
 #include <algorithm>
 #include <cmath>
-#include <filesystem>
 #include <fstream>
 #include <sstream>
 
-#include "kestrel_platform.h"
+#include "tools/soak/daemon_driver.h"
 
 extern char** environ;
 
@@ -37,11 +36,6 @@ std::string read_file(const std::string& path) {
   std::stringstream text;
   text << in.rdbuf();
   return text.str();
-}
-
-void write_executable(const std::string& path, const std::string& text) {
-  std::ofstream(path) << text;
-  chmod(path.c_str(), 0755);
 }
 
 }  // namespace
@@ -69,25 +63,16 @@ int64_t now_ns() {
   return int64_t{ts.tv_sec} * 1000000000 + ts.tv_nsec;
 }
 
-TempDir::TempDir() {
-  const char* tmp = getenv("TMPDIR");
-  std::string templ =
-      std::string(tmp != nullptr && tmp[0] != '\0' ? tmp : "/tmp") + "/kestrel-bench-XXXXXX";
-  if (mkdtemp(templ.data()) == nullptr) {
-    fprintf(stderr, "mkdtemp: %s\n", strerror(errno));
+TempDir::TempDir()
+    : path_(std::make_unique<std::string>(kestrel_soak::make_run_dir("kestrel-bench"))) {
+  if (path_->empty()) {
+    fprintf(stderr, "cannot create a run directory: %s\n", strerror(errno));
     exit(1);
-  }
-  path_ = templ;
-  mkdir(bin().c_str(), 0755);
-  mkdir(file("root").c_str(), 0755);
-  for (const char* tool : {"diag_mdlog", "chown", "chmod"}) {
-    write_executable(bin() + "/" + tool, "#!/bin/sh\nexit 0\n");
   }
 }
 
 TempDir::~TempDir() {
-  std::error_code ignored;
-  std::filesystem::remove_all(path_, ignored);
+  kestrel_soak::remove_run_dir(*path_);
 }
 
 ChildProcess::ChildProcess(const std::vector<std::string>& argv,
@@ -167,20 +152,15 @@ bool ChildProcess::running() {
 
 std::map<std::string, std::string> daemon_env(const TempDir& dir, const std::string& socket,
                                               uint32_t kernel_port, double time_scale) {
-  char scale[32];
-  snprintf(scale, sizeof scale, "%g", time_scale);
-  return {
-      {"KESTREL_SENSOR1_SOCKET", socket},
-      {"KESTREL_KERNEL_PORT", std::to_string(kernel_port)},
-      {"KESTREL_TIME_SCALE", scale},
-      {"KESTREL_SYSROOT", dir.file("root")},
-      // Nothing else of the caller's environment reaches the daemon's stand-ins.
-      {"KESTREL_PROPERTIES", ""},
-      {"KESTREL_SENSOR_REG", ""},
-      {"KESTREL_SENSOR1_INIT_RESULT", ""},
-      {"KESTREL_DIAG_INIT", ""},
-      {"KESTREL_DIAG_TX_MODE_RESULT", ""},
-  };
+  std::map<std::string, std::string> env =
+      kestrel_soak::daemon_environment(dir.path(), socket, time_scale, "");
+  env["KESTREL_KERNEL_PORT"] = std::to_string(kernel_port);
+  // Nothing else of the caller's environment reaches the daemon's stand-ins ("" is unset).
+  for (const char* name : {"KESTREL_SENSOR_REG", "KESTREL_SENSOR1_INIT_RESULT", "KESTREL_DIAG_INIT",
+                           "KESTREL_DIAG_TX_MODE_RESULT"}) {
+    env[name] = "";
+  }
+  return env;
 }
 
 std::string kestreld_binary() {
@@ -198,63 +178,11 @@ std::string self_binary() {
   return path;
 }
 
-NetlinkPort::NetlinkPort(uint32_t port_id) : port_id_(port_id), buffer_(64 * 1024) {
-  fd_ = socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, platform_netlink_protocol());
-  if (fd_ < 0) return;
-  // As much receive buffer as the system grants: 4 MiB forced where allowed, else the
-  // administrator's maximum.
-  const int size = 4 * 1024 * 1024;
-  if (setsockopt(fd_, SOL_SOCKET, SO_RCVBUFFORCE, &size, sizeof size) != 0) {
-    setsockopt(fd_, SOL_SOCKET, SO_RCVBUF, &size, sizeof size);
-  }
-  sockaddr_nl addr;
-  memset(&addr, 0, sizeof addr);
-  addr.nl_family = AF_NETLINK;
-  addr.nl_pid = port_id;
-  if (bind(fd_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
-    fprintf(stderr, "bind netlink port %u: %s\n", port_id, strerror(errno));
-    close(fd_);
-    fd_ = -1;
-  }
-}
-
-NetlinkPort::~NetlinkPort() {
-  if (fd_ >= 0) close(fd_);
-}
-
-bool NetlinkPort::send_to(uint32_t port_id, const void* data, size_t size) {
-  sockaddr_nl to;
-  memset(&to, 0, sizeof to);
-  to.nl_family = AF_NETLINK;
-  to.nl_pid = port_id;
-  return sendto(fd_, data, size, 0, reinterpret_cast<sockaddr*>(&to), sizeof to) ==
-         static_cast<ssize_t>(size);
-}
-
 bool NetlinkPort::receive_type(uint16_t type, std::chrono::milliseconds timeout,
                                std::vector<uint8_t>* frame) {
-  const int64_t deadline = now_ns() + static_cast<int64_t>(timeout.count()) * 1000000;
-  for (;;) {
-    const int64_t left_ms = (deadline - now_ns()) / 1000000;
-    if (left_ms < 0) return false;
-    pollfd p = {fd_, POLLIN, 0};
-    if (poll(&p, 1, static_cast<int>(left_ms)) <= 0) continue;
-    const ssize_t n = recv(fd_, buffer_.data(), buffer_.size(), MSG_DONTWAIT);
-    if (n <= 0) continue;
-    // The walk of netlink(7), over the frames of the datagram.
-    size_t pos = 0;
-    while (static_cast<size_t>(n) - pos >= sizeof(nlmsghdr)) {
-      nlmsghdr hdr;
-      memcpy(&hdr, buffer_.data() + pos, sizeof hdr);
-      if (hdr.nlmsg_len < sizeof hdr || hdr.nlmsg_len > static_cast<size_t>(n) - pos) break;
-      if (hdr.nlmsg_type == type) {
-        frame->assign(buffer_.begin() + static_cast<long>(pos),
-                      buffer_.begin() + static_cast<long>(pos + hdr.nlmsg_len));
-        return true;
-      }
-      pos += NLMSG_ALIGN(hdr.nlmsg_len);
-    }
-  }
+  const std::optional<kestrelctl::Frame> f = next_frame_of_type(type, timeout);
+  if (f) *frame = f->raw;
+  return f.has_value();
 }
 
 namespace {
@@ -307,7 +235,7 @@ uint64_t NetlinkPort::drain(uint16_t type) {
   uint64_t counted = 0;
   int datagrams = 0;
   do {
-    counted += batch.receive(fd_, type, &datagrams);
+    counted += batch.receive(fd(), type, &datagrams);
   } while (datagrams == static_cast<int>(kDrainBatch));
   return counted;
 }
@@ -340,17 +268,6 @@ void FrameDrain::run() {
       }
     } while (datagrams == static_cast<int>(kDrainBatch));
   }
-}
-
-std::vector<uint8_t> command_frame(uint16_t command, const std::vector<int32_t>& words) {
-  nlmsghdr hdr;
-  memset(&hdr, 0, sizeof hdr);
-  hdr.nlmsg_len = static_cast<uint32_t>(sizeof hdr + 4 * words.size());
-  hdr.nlmsg_type = command;
-  std::vector<uint8_t> frame(hdr.nlmsg_len);
-  memcpy(frame.data(), &hdr, sizeof hdr);
-  if (!words.empty()) memcpy(frame.data() + sizeof hdr, words.data(), 4 * words.size());
-  return frame;
 }
 
 ProcessStatus process_status(pid_t pid) {

@@ -15,12 +15,15 @@
 #include <chrono>
 #include <functional>
 #include <map>
+#include <memory>
 #include <optional>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include <benchmark/benchmark.h>
+
+#include "tools/ctl/kernel_port.h"
 
 namespace kestrel_bench {
 
@@ -41,16 +44,14 @@ int64_t now_ns();
 // chmod), so DIAG start-up costs a fork and nothing more.
 class TempDir {
  public:
-  TempDir();
+  TempDir();  // kestrel-soak's run directory: bin() is its tools/
   ~TempDir();
-  TempDir(const TempDir&) = delete;
-  TempDir& operator=(const TempDir&) = delete;
-  const std::string& path() const { return path_; }
-  std::string file(const std::string& name) const { return path_ + "/" + name; }
-  std::string bin() const { return path_ + "/bin"; }
+  const std::string& path() const { return *path_; }
+  std::string file(const std::string& name) const { return *path_ + "/" + name; }
+  std::string bin() const { return *path_ + "/tools"; }
 
  private:
-  std::string path_;
+  std::unique_ptr<const std::string> path_;  // one owner removes the directory
 };
 
 // A child process: argv[0] is run with the current environment plus env (PATH gets path_prepend
@@ -82,30 +83,17 @@ std::string kestreld_binary();
 std::string kestrel_sim_binary();
 std::string self_binary();
 
-// The kernel side: a netlink socket bound to a port id, with a receive buffer as large as the
-// system allows.
-class NetlinkPort {
+// The kernel side: kestrelctl's KernelPort bound to a port id.
+class NetlinkPort : public kestrelctl::KernelPort {
  public:
-  explicit NetlinkPort(uint32_t port_id);
-  ~NetlinkPort();
-  NetlinkPort(const NetlinkPort&) = delete;
-  NetlinkPort& operator=(const NetlinkPort&) = delete;
-  bool ok() const { return fd_ >= 0; }
-  int fd() const { return fd_; }
-  uint32_t port_id() const { return port_id_; }
-  // Sends one datagram to a port id.
-  bool send_to(uint32_t port_id, const void* data, size_t size);
-  // Waits for the next frame of the given type (frames of other types are dropped) and copies
+  explicit NetlinkPort(uint32_t port_id) { open_bound(port_id); }
+  bool ok() const { return fd() >= 0; }
+  // Waits for the next frame of the given type (frames of other types stay queued) and copies
   // the whole frame into frame. False on timeout.
   bool receive_type(uint16_t type, std::chrono::milliseconds timeout, std::vector<uint8_t>* frame);
-  // Receives every datagram already queued, without waiting, and returns the number of frames
-  // of the given type among them.
+  // Receives every datagram already queued on the socket, without waiting and many a system
+  // call, and returns the number of frames of the given type among them.
   uint64_t drain(uint16_t type);
-
- private:
-  int fd_ = -1;
-  uint32_t port_id_ = 0;
-  std::vector<uint8_t> buffer_;
 };
 
 // The kernel side of a stream: a NetlinkPort whose thread receives everything as it comes, so
@@ -132,9 +120,6 @@ class FrameDrain {
   std::atomic<int64_t> last_ns_{0};
   std::thread thread_;
 };
-
-// A kernel frame as the kernel driver sends it: command, then 32-bit payload words.
-std::vector<uint8_t> command_frame(uint16_t command, const std::vector<int32_t>& words);
 
 // /proc/<pid> readings.
 struct ProcessStatus {

@@ -365,13 +365,12 @@ Setup& setup() {
 // One command and its reply; false when no reply came.
 bool round_trip(NetlinkPort* kernel, uint32_t to, const std::vector<uint8_t>& command,
                 std::vector<uint8_t>* reply) {
-  return kernel->send_to(to, command.data(), command.size()) &&
-         kernel->receive_type(FRAME_SELFTEST, kReplyTimeout, reply);
+  return kernel->send_to(to, command) && kernel->receive_type(FRAME_SELFTEST, kReplyTimeout, reply);
 }
 
 void run_round_trips(benchmark::State& state, NetlinkPort* kernel, uint32_t to,
                      kestrel_sim::Simulator* sim, pid_t measured) {
-  const std::vector<uint8_t> command = kestrel_bench::command_frame(NETLINK_MESSAGE_SELFTEST, {0});
+  const std::vector<uint8_t> command = kestrelctl::build_command(NETLINK_MESSAGE_SELFTEST, {0});
   std::vector<uint8_t> reply;
   // One untimed command first: the reply must be the accelerometer's.
   if (!round_trip(kernel, to, command, &reply) || reply.size() != 88 ||
@@ -483,7 +482,7 @@ void count_records_per_command(Setup& s) {
   const pid_t pid = daemon.pid();
   kestrel_bench::wait_until([&] { return kestrel_bench::process_thread_count(pid) <= 2; },
                             std::chrono::seconds(20));
-  const std::vector<uint8_t> command = kestrel_bench::command_frame(NETLINK_MESSAGE_SELFTEST, {0});
+  const std::vector<uint8_t> command = kestrelctl::build_command(NETLINK_MESSAGE_SELFTEST, {0});
   // The receive loop's line after a command comes once the reply is out: a pause after the
   // first (uncounted) command and after the last lets every line reach the file.
   if (!round_trip(s.kernel.get(), kestrel_bench::kDaemonPort, command, &frame)) return;

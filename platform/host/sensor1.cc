@@ -160,14 +160,8 @@ bool take_fault(Connection* h, FaultOp op, int* result) {
 }
 
 const char* op_name(FaultOp op) {
-  switch (op) {
-    case FaultOp::kAlloc:
-      return "alloc";
-    case FaultOp::kWrite:
-      return "write";
-    default:
-      return "close";
-  }
+  static const char* const kNames[] = {"", "alloc", "write", "close"};
+  return kNames[static_cast<int>(op)];
 }
 
 // Runs h's callback on the library thread; a close of h waits until it has returned.
