@@ -84,19 +84,14 @@ uint32_t relay_kernel_port(size_t i) {
 
 // ---- The relays (each runs as a child process of this program) ----
 
-// WRITE of the 12-byte self-test request (SensorID 0, TestType 6), its txn id counting up.
-struct WriteRecord {
-  std::vector<uint8_t> bytes;
-  WriteRecord() {
-    uint8_t request[12] = {};
-    store_u32(request, 4, 6);
-    bytes = sensor1_wire::encode(
-        sensor1_wire::message(sensor1_wire::kWrite, {kServiceSmgr, kMsgSmgrSingleSensorTest, 0, 0},
-                              request, sizeof request));
-  }
-  void next_txn() { ++bytes[kTxnAt]; }
-  static constexpr size_t kTxnAt = sensor1_wire::kLengthSize + 1 + 10;
-};
+// WRITE of the 12-byte self-test request (SensorID 0, TestType 6), as the daemon writes it.
+std::vector<uint8_t> write_record() {
+  uint8_t request[12] = {};
+  store_u32(request, 4, 6);
+  return sensor1_wire::encode(sensor1_wire::message(
+      sensor1_wire::kWrite, {kServiceSmgr, kMsgSmgrSingleSensorTest, 0, kTxnSingleSensorTest},
+      request, sizeof request));
+}
 
 // Reads whole records from the simulator and keeps the words of the latest indication.
 class RecordReader {
@@ -235,7 +230,7 @@ int run_relay(size_t i, const char* socket_path) {
     if (pthread_create(&thread, nullptr, hand_over_reader, &hand_over) != 0) return 1;
   }
   uint8_t datagram[1024];
-  WriteRecord write_record;
+  const std::vector<uint8_t> request = write_record();
   uint8_t words[32];
   uint8_t reply[16 + 72];
   int32_t previous = 0;
@@ -251,8 +246,7 @@ int run_relay(size_t i, const char* socket_path) {
       KLOGI("%s: LSM6DSM ACCEL SELFTEST, TestType = (%d)\n", "get_selftest_result", 6);
       KLOGI("%s: msg_hdr.msg_id = 0x%x, id = %u\n", "get_selftest_result", 13, 0u);
     }
-    write_record.next_txn();
-    if (!sensor1_wire::send_all(sim, write_record.bytes.data(), write_record.bytes.size())) {
+    if (!sensor1_wire::send_all(sim, request.data(), request.size())) {
       return 1;
     }
     if (log_lines) KLOGI("waiting for response IN - timeout=%d", 8000);
@@ -319,20 +313,15 @@ Setup& setup() {
 
   const std::vector<uint8_t> indication =
       kestrel_sim::test_indication_body(kSmgrAccel, 6, 0, 0, 0, kAccelWords);
-  const std::vector<uint8_t> response = kestrel_sim::common_response_body(0, 0);
   s.echo = std::make_unique<kestrel_sim::Simulator>(s.dir.file("echo.sock"));
   s.echo->set_request_hook(
       [indication](kestrel_sim::Simulator& sim, const kestrel_sim::Request& r) {
         sim.indicate_to(r.connection, {kServiceSmgr, kMsgSmgrSingleSensorTest, 0, r.header.txn_id},
                         indication);
       });
-  s.echo_with_response = std::make_unique<kestrel_sim::Simulator>(s.dir.file("echo2.sock"));
-  s.echo_with_response->set_request_hook(
-      [indication, response](kestrel_sim::Simulator& sim, const kestrel_sim::Request& r) {
-        const kestrel_sim::Header h{kServiceSmgr, kMsgSmgrSingleSensorTest, 0, r.header.txn_id};
-        sim.respond_to(r.connection, h, response);
-        sim.indicate_to(r.connection, h, indication);
-      });
+  // The healthy phone, as the daemon's: the response, then the indication.
+  s.echo_with_response =
+      std::make_unique<kestrel_sim::Simulator>(s.dir.file("echo2.sock"), /*healthy=*/true);
   for (size_t i = 0; i < kRelayCount; ++i) {
     kestrel_sim::Simulator* sim = relay_simulator(s, i);
     const int opened = sim->opened_connections();
