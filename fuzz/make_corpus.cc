@@ -16,6 +16,8 @@
 #include <string>
 #include <vector>
 
+#include "tools/sim/simulator.h"
+
 namespace {
 
 using bytes = std::vector<uint8_t>;
@@ -179,37 +181,12 @@ bytes indication(uint32_t service, int32_t msg_id, const bytes& body, uint8_t st
   return callback(2, kHeaderAndBody, state, service, msg_id, 0, body);
 }
 
-bytes test_indication(uint8_t sensor, int32_t test_type, uint32_t result, uint8_t error_valid,
-                      uint8_t error_code, std::initializer_list<int32_t> result_words) {
-  bytes b(84, 0);
-  b[0] = sensor;
-  memcpy(&b[4], &test_type, 4);
-  memcpy(&b[8], &result, 4);
-  b[12] = error_valid;
-  b[13] = error_code;
-  size_t i = 0;
-  for (int32_t w : result_words) memcpy(&b[20 + 4 * i++], &w, 4);
-  return b;
-}
-
-bytes sample(uint8_t sensor, uint8_t data_type, int32_t x, int32_t y, int32_t z) {
-  bytes b(24, 0);
-  b[8] = sensor;
-  b[9] = data_type;
-  memcpy(&b[12], &x, 4);
-  memcpy(&b[16], &y, 4);
-  memcpy(&b[20], &z, 4);
-  return b;
-}
+// The phone model's bodies.
+using kestrel_sim::sample_indication_body;
+using kestrel_sim::test_indication_body;
 
 bytes daf_indication(uint8_t code, uint8_t valid, uint32_t length) {
-  bytes b(32, 0);
-  b[0] = code;
-  b[1] = valid;
-  memcpy(&b[4], &length, 4);
-  const int32_t data[6] = {1650, 410, 730, 290, 5200, 62};
-  memcpy(&b[8], data, sizeof data);
-  return b;
+  return kestrel_sim::daf_indication_body(code, valid, length, {1650, 410, 730, 290, 5200, 62});
 }
 
 void rcv_test_msg_seeds() {
@@ -252,29 +229,35 @@ void rcv_test_msg_seeds() {
 
   write_seed(
       t, "ind_test_accel_passed",
-      indication(0, 13, test_indication(0, 6, 0, 0, 0, {1, 9, -14, 1010, 1, 298, -301, 402})));
-  write_seed(t, "ind_test_gyro_passed",
-             indication(0, 13,
-                        test_indication(10, 6, 0, 0, 0,
-                                        {1, 1, 1320, -790, 455, 1, 10, -7, 3, 398, -405, 441})));
+      indication(0, 13, test_indication_body(0, 6, 0, 0, 0, {1, 9, -14, 1010, 1, 298, -301, 402})));
+  write_seed(
+      t, "ind_test_gyro_passed",
+      indication(0, 13,
+                 test_indication_body(10, 6, 0, 0, 0,
+                                      {1, 1, 1320, -790, 455, 1, 10, -7, 3, 398, -405, 441})));
   write_seed(t, "ind_test_gyro_temperature",
-             indication(0, 13, test_indication(10, 13, 0, 0, 0, {2, 1835008})));
+             indication(0, 13, test_indication_body(10, 13, 0, 0, 0, {2, 1835008})));
   write_seed(t, "ind_test_mag_fuse_rom_failed",
-             indication(0, 13, test_indication(20, 10, 1, 1, 7, {0x48, 0x09, 0x01})));
+             indication(0, 13, test_indication_body(20, 10, 1, 1, 7, {0x48, 0x09, 0x01})));
   write_seed(t, "ind_test_mag_selftest_failed_without_code",
-             indication(0, 13, test_indication(20, 6, 1, 0, 0, {1, 0, -28, 17, -690})));
+             indication(0, 13, test_indication_body(20, 6, 1, 0, 0, {1, 0, -28, 17, -690})));
   write_seed(t, "ind_test_pressure_passed",
-             indication(0, 13, test_indication(30, 6, 0, 0, 0, {1, 101280})));
-  write_seed(t, "ind_test_unknown_sensor", indication(0, 13, test_indication(40, 3, 0, 0, 0, {})));
-  write_seed(t, "ind_sample_accel", indication(0, 3, sample(0, 0, 6553, -13107, 642252)));
-  write_seed(t, "ind_sample_gyro", indication(0, 3, sample(10, 0, 1200, -800, 40)));
+             indication(0, 13, test_indication_body(30, 6, 0, 0, 0, {1, 101280})));
+  write_seed(t, "ind_test_unknown_sensor",
+             indication(0, 13, test_indication_body(40, 3, 0, 0, 0, {})));
+  write_seed(t, "ind_sample_accel",
+             indication(0, 3, sample_indication_body(0, 0, 6553, -13107, 642252)));
+  write_seed(t, "ind_sample_gyro", indication(0, 3, sample_indication_body(10, 0, 1200, -800, 40)));
   write_seed(t, "ind_sample_mag_sensitivity_set",
-             indication(0, 3, sample(20, 0, 2000, -3000, 4000), kStateOpen | 8));
-  write_seed(t, "ind_sample_mag_sensitivity_zero", indication(0, 3, sample(20, 0, 2000, 0, -1)));
-  write_seed(t, "ind_sample_pressure", indication(0, 3, sample(30, 0, 1, 2, 3)));
-  write_seed(t, "ind_sample_light", indication(0, 3, sample(40, 0, 65536, 0, 0)));
-  write_seed(t, "ind_sample_sensor60", indication(0, 3, sample(60, 0, 70000, -70000, 5)));
-  write_seed(t, "ind_sample_secondary", indication(0, 3, sample(0, 1, 65536, 131072, -65536)));
+             indication(0, 3, sample_indication_body(20, 0, 2000, -3000, 4000), kStateOpen | 8));
+  write_seed(t, "ind_sample_mag_sensitivity_zero",
+             indication(0, 3, sample_indication_body(20, 0, 2000, 0, -1)));
+  write_seed(t, "ind_sample_pressure", indication(0, 3, sample_indication_body(30, 0, 1, 2, 3)));
+  write_seed(t, "ind_sample_light", indication(0, 3, sample_indication_body(40, 0, 65536, 0, 0)));
+  write_seed(t, "ind_sample_sensor60",
+             indication(0, 3, sample_indication_body(60, 0, 70000, -70000, 5)));
+  write_seed(t, "ind_sample_secondary",
+             indication(0, 3, sample_indication_body(0, 1, 65536, 131072, -65536)));
   write_seed(t, "ind_daf_als_rgb", indication(44, 33, daf_indication(61, 1, 24)));
   write_seed(t, "ind_daf_short", indication(44, 33, daf_indication(51, 1, 8)));
   write_seed(t, "ind_daf_als_rgb_invalid", indication(44, 33, daf_indication(61, 0, 24)));
