@@ -306,26 +306,32 @@ long process_cpu_ticks(pid_t pid) {
 
 namespace {
 
-// Sums the named fields of /proc/<pid>/task/*/status.
-long sum_task_status(pid_t pid, const std::vector<std::string>& fields) {
+// The sum of read(the thread's /proc directory) over the process's threads; -1 when unreadable.
+int64_t sum_over_threads(pid_t pid, const std::function<int64_t(const std::string&)>& read) {
   const std::string dir = "/proc/" + std::to_string(pid) + "/task";
   DIR* d = opendir(dir.c_str());
   if (d == nullptr) return -1;
-  long total = 0;
+  int64_t total = 0;
   while (dirent* e = readdir(d)) {
-    if (e->d_name[0] == '.') continue;
-    std::istringstream text(read_file(dir + "/" + e->d_name + "/status"));
-    std::string line;
-    while (std::getline(text, line)) {
-      for (const std::string& field : fields) {
-        if (line.rfind(field + ":", 0) == 0) {
-          total += strtol(line.c_str() + field.size() + 1, nullptr, 10);
-        }
-      }
-    }
+    if (e->d_name[0] != '.') total += read(dir + "/" + e->d_name);
   }
   closedir(d);
   return total;
+}
+
+// Sums the named fields of each thread's status.
+long sum_task_status(pid_t pid, const std::vector<std::string>& fields) {
+  return static_cast<long>(sum_over_threads(pid, [&](const std::string& task) {
+    std::istringstream text(read_file(task + "/status"));
+    int64_t total = 0;
+    for (std::string line; std::getline(text, line);) {
+      for (const std::string& field : fields) {
+        if (line.rfind(field + ":", 0) == 0)
+          total += strtol(line.c_str() + field.size() + 1, nullptr, 10);
+      }
+    }
+    return total;
+  }));
 }
 
 }  // namespace
@@ -339,28 +345,13 @@ long process_voluntary_switches(pid_t pid) {
 }
 
 int64_t process_cpu_ns(pid_t pid) {
-  const std::string dir = "/proc/" + std::to_string(pid) + "/task";
-  DIR* d = opendir(dir.c_str());
-  if (d == nullptr) return -1;
-  int64_t total = 0;
-  while (dirent* e = readdir(d)) {
-    if (e->d_name[0] == '.') continue;
-    total += strtoll(read_file(dir + "/" + e->d_name + "/schedstat").c_str(), nullptr, 10);
-  }
-  closedir(d);
-  return total;
+  return sum_over_threads(pid, [](const std::string& task) {
+    return strtoll(read_file(task + "/schedstat").c_str(), nullptr, 10);
+  });
 }
 
 long process_thread_count(pid_t pid) {
-  const std::string dir = "/proc/" + std::to_string(pid) + "/task";
-  DIR* d = opendir(dir.c_str());
-  if (d == nullptr) return -1;
-  long n = 0;
-  while (dirent* e = readdir(d)) {
-    if (e->d_name[0] != '.') ++n;
-  }
-  closedir(d);
-  return n;
+  return static_cast<long>(sum_over_threads(pid, [](const std::string&) { return 1; }));
 }
 
 bool wait_until(const std::function<bool()>& cond, std::chrono::milliseconds timeout) {
