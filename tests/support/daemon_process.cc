@@ -7,8 +7,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <condition_variable>
-#include <mutex>
+#include <fstream>
+#include <sstream>
 #include <thread>
 
 #ifndef KESTRELD_BINARY
@@ -17,74 +17,10 @@
 
 extern char** environ;
 
-struct DaemonProcess::State {
-  mutable std::mutex mutex;
-  mutable std::condition_variable cond;
-  std::vector<LogRecord> records;
-  std::string output;
-  bool last_open = false;  // the last record may still get continuation lines
-  int read_fd = -1;
-  std::thread reader;
-  std::optional<int> status;
-};
-
-namespace {
-
-int priority_of(char p) {
-  switch (p) {
-    case 'V':
-      return 2;
-    case 'D':
-      return 3;
-    case 'I':
-      return 4;
-    case 'W':
-      return 5;
-    case 'E':
-      return 6;
-    case 'F':
-      return 7;
-    default:
-      return 0;
-  }
-}
-
-// Parses "<tag> <P> <MM-DD> <HH:MM:SS> <pid> <tid> <message>" (pid and tid padded with blanks).
-bool parse_record(const std::string& line, LogRecord* record) {
-  size_t pos = 0;
-  auto field = [&](std::string* out) {
-    while (pos < line.size() && line[pos] == ' ') ++pos;
-    const size_t start = pos;
-    while (pos < line.size() && line[pos] != ' ') ++pos;
-    if (pos == start) return false;
-    *out = line.substr(start, pos - start);
-    return true;
-  };
-  std::string tag, prio, date, time, pid, tid;
-  if (!field(&tag) || !field(&prio) || !field(&date) || !field(&time) || !field(&pid) ||
-      !field(&tid)) {
-    return false;
-  }
-  if (prio.size() != 1 || priority_of(prio[0]) == 0 || date.size() != 5 || date[2] != '-' ||
-      time.size() != 8 || time[2] != ':' || time[5] != ':' ||
-      pid.find_first_not_of("0123456789") != std::string::npos ||
-      tid.find_first_not_of("0123456789") != std::string::npos) {
-    return false;
-  }
-  // Exactly one blank separates the thread id from the message, which may start with blanks.
-  record->tag = tag;
-  record->priority = priority_of(prio[0]);
-  record->message = pos < line.size() ? line.substr(pos + 1) : "";
-  record->tid = atol(tid.c_str());
-  return true;
-}
-
-}  // namespace
-
-DaemonProcess::DaemonProcess(const DaemonEnv& env, const std::string& path_prepend)
-    : state_(new State) {
-  int fds[2];
-  if (pipe2(fds, O_CLOEXEC) != 0) abort();
+DaemonProcess::DaemonProcess(const DaemonEnv& env, const std::string& path_prepend) {
+  static int started = 0;
+  log_path_ = std::string(getenv("KESTREL_SENSOR1_SOCKET")) + ".daemon" +
+              std::to_string(started++) + ".log";
   std::map<std::string, std::string> merged;
   for (char** e = environ; *e != nullptr; ++e) {
     const char* eq = strchr(*e, '=');
@@ -99,64 +35,66 @@ DaemonProcess::DaemonProcess(const DaemonEnv& env, const std::string& path_prepe
   std::vector<char*> envp;
   for (auto& s : strings) envp.push_back(s.data());
   envp.push_back(nullptr);
-
+  const int log = open(log_path_.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+  const int devnull = open("/dev/null", O_RDWR | O_CLOEXEC);
   pid_ = fork();
   if (pid_ == 0) {
-    dup2(fds[1], 2);
-    int devnull = open("/dev/null", O_RDWR);
+    dup2(log, 2);
     dup2(devnull, 0);
     dup2(devnull, 1);
     char* argv[] = {const_cast<char*>(KESTRELD_BINARY), nullptr};
     execve(KESTRELD_BINARY, argv, envp.data());
     _exit(127);
   }
-  close(fds[1]);
-  state_->read_fd = fds[0];
-  State* st = state_;
-  state_->reader = std::thread([st] {
-    std::string pending;
-    char buf[4096];
-    for (;;) {
-      ssize_t n = read(st->read_fd, buf, sizeof buf);
-      if (n <= 0) break;
-      std::lock_guard<std::mutex> lock(st->mutex);
-      st->output.append(buf, static_cast<size_t>(n));
-      pending.append(buf, static_cast<size_t>(n));
-      size_t nl;
-      while ((nl = pending.find('\n')) != std::string::npos) {
-        std::string line = pending.substr(0, nl);
-        pending.erase(0, nl + 1);
-        LogRecord record;
-        if (parse_record(line, &record)) {
-          st->records.push_back(std::move(record));
-          st->last_open = true;
-        } else if (st->last_open && !st->records.empty()) {
-          st->records.back().message += "\n" + line;
-        }
-      }
-      st->cond.notify_all();
-    }
-    std::lock_guard<std::mutex> lock(st->mutex);
-    st->cond.notify_all();
-  });
+  close(log);
+  close(devnull);
 }
 
 DaemonProcess::~DaemonProcess() {
-  kill_now();
-  if (state_->reader.joinable()) state_->reader.join();
-  close(state_->read_fd);
-  delete state_;
+  if (!status_ && pid_ > 0) {
+    kill(pid_, SIGKILL);
+    wait_exit(std::chrono::milliseconds(5000));
+  }
+  unlink(log_path_.c_str());
 }
 
+std::string DaemonProcess::output() const {
+  std::ifstream in(log_path_);
+  std::stringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+// A line "<tag> <P> <MM-DD> <HH:MM:SS> <pid> <tid> <message>" (pid and tid padded with blanks)
+// starts a record; any other line continues the message before it. The last line, still being
+// written, is left out.
 std::vector<LogRecord> DaemonProcess::records() const {
-  std::lock_guard<std::mutex> lock(state_->mutex);
-  return state_->records;
+  const std::string text = output();
+  std::vector<LogRecord> out;
+  for (size_t start = 0, end; (end = text.find('\n', start)) != std::string::npos;
+       start = end + 1) {
+    const std::string line = text.substr(start, end - start);
+    std::istringstream in(line);
+    std::string tag, prio, date, time, pid, tid;
+    in >> tag >> prio >> date >> time >> pid >> tid;
+    const size_t p = prio.size() == 1 ? std::string("??VDIWEF").find(prio[0]) : 0;
+    if (p >= 2 && p != std::string::npos && date.size() == 5 && date[2] == '-' &&
+        time.size() == 8 && pid.find_first_not_of("0123456789") == std::string::npos &&
+        !tid.empty() && tid.find_first_not_of("0123456789") == std::string::npos) {
+      // Exactly one blank separates the thread id from the message, which may start with blanks.
+      const size_t at = in.eof() ? line.size() : static_cast<size_t>(in.tellg()) + 1;
+      out.push_back(
+          {static_cast<int>(p), tag, at < line.size() ? line.substr(at) : "", atol(tid.c_str())});
+    } else if (!out.empty()) {
+      out.back().message += "\n" + line;
+    }
+  }
+  return out;
 }
 
 std::vector<std::string> DaemonProcess::messages(const std::string& tag) const {
   std::vector<std::string> out;
-  std::lock_guard<std::mutex> lock(state_->mutex);
-  for (const LogRecord& r : state_->records) {
+  for (const LogRecord& r : records()) {
     if (r.tag == tag) out.push_back(r.message);
   }
   return out;
@@ -164,44 +102,31 @@ std::vector<std::string> DaemonProcess::messages(const std::string& tag) const {
 
 bool DaemonProcess::wait_for(const std::string& message, std::chrono::milliseconds timeout,
                              size_t n, const std::string& tag) const {
-  // A message ending in "\n" is only complete once the empty line after it has arrived, which
-  // comes with the next record; so a trailing newline is matched against the text before it.
-  std::unique_lock<std::mutex> lock(state_->mutex);
-  return state_->cond.wait_for(lock, timeout, [&] {
-    size_t seen = 0;
-    for (const LogRecord& r : state_->records) {
-      if (r.tag != tag) continue;
-      if (r.message == message || (!message.empty() && message.back() == '\n' &&
-                                   r.message == message.substr(0, message.size() - 1))) {
-        ++seen;
-      }
-    }
-    return seen >= n;
-  });
-}
-
-std::string DaemonProcess::output() const {
-  std::lock_guard<std::mutex> lock(state_->mutex);
-  return state_->output;
-}
-
-std::optional<int> DaemonProcess::wait_exit(std::chrono::milliseconds timeout) {
-  if (state_->status) return state_->status;
+  const std::string bare =
+      !message.empty() && message.back() == '\n' ? message.substr(0, message.size() - 1) : message;
   const auto deadline = std::chrono::steady_clock::now() + timeout;
   for (;;) {
-    int status = 0;
-    pid_t r = waitpid(pid_, &status, WNOHANG);
-    if (r == pid_) {
-      state_->status = WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status);
-      return state_->status;
+    size_t seen = 0;
+    for (const LogRecord& r : records()) {
+      seen += r.tag == tag && (r.message == message || r.message == bare);
     }
-    if (std::chrono::steady_clock::now() >= deadline) return std::nullopt;
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    if (seen >= n) return true;
+    if (std::chrono::steady_clock::now() >= deadline) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
   }
 }
 
-void DaemonProcess::kill_now() {
-  if (state_->status || pid_ <= 0) return;
-  ::kill(pid_, SIGKILL);
-  wait_exit(std::chrono::milliseconds(5000));
+std::optional<int> DaemonProcess::wait_exit(std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!status_) {
+    int status = 0;
+    if (waitpid(pid_, &status, WNOHANG) == pid_) {
+      status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status);
+    } else if (std::chrono::steady_clock::now() >= deadline) {
+      return std::nullopt;
+    } else {
+      std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+  }
+  return status_;
 }

@@ -1,5 +1,5 @@
-// Runs kestreld as a child process (in the test's own network namespace) and reads its log
-// records from its stderr, as Debian's liblog writes them:
+// Runs kestreld as a child process (in the test's own network namespace) with its stderr in a
+// file, and reads its log records from there, as Debian's liblog writes them:
 //   KESTRELD <P> <MM-DD> <HH:MM:SS> <pid> <tid> <message>
 #pragma once
 
@@ -26,20 +26,18 @@ class DaemonProcess {
   DaemonProcess& operator=(const DaemonProcess&) = delete;
 
   pid_t pid() const { return pid_; }
-
+  // The records so far; a message's trailing newline shows once the next record has come.
   std::vector<LogRecord> records() const;
   std::vector<std::string> messages(const std::string& tag = "KESTRELD") const;
+  // Waits until at least n records of tag carry message (its trailing newline not needed).
   bool wait_for(const std::string& message, std::chrono::milliseconds timeout, size_t n = 1,
                 const std::string& tag = "KESTRELD") const;
-  // Everything the daemon wrote to stderr, for failure messages.
-  std::string output() const;
-
+  std::string output() const;  // everything written to stderr, for failure messages
   // Exit status once the process has ended within timeout (-signal when killed).
   std::optional<int> wait_exit(std::chrono::milliseconds timeout);
-  void kill_now();
 
  private:
-  struct State;
-  State* state_;
+  std::string log_path_;
   pid_t pid_ = -1;
+  std::optional<int> status_;
 };
