@@ -105,7 +105,7 @@ KernelPort::Wait KernelPort::read_datagram(int timeout_ms, std::string* error) {
     fail(error, std::string("cannot wait for frames: ") + strerror(errno));
     return Wait::kError;
   }
-  static uint8_t buf[65536];
+  thread_local uint8_t buf[65536];  // ports may receive on several threads at once
   struct sockaddr_nl from;
   socklen_t from_len = sizeof from;
   memset(&from, 0, sizeof from);
