@@ -467,7 +467,7 @@ int Chaos::run() {
     faults += injected[k];
   }
   printf(
-      "\nchaos: %ld faults, %ld commands done (%ld with a reply to wait for), slowest %.0f ms "
+      "\nchaos: %ld faults, %ld commands done (%ld bring a reply frame), slowest %.0f ms "
       "(command %u), %ld exits with the close's result and restarts, %ld checkpoints\n",
       faults, commands_, waiting_commands_, slowest_ms_, unsigned{slowest_command_}, exits_,
       checkpoints_);
@@ -476,6 +476,7 @@ int Chaos::run() {
          baseline_.threads);
   printf("chaos: last checkpoint:          rss %ld kB (anon %ld), %d fds, %d threads\n",
          last_.rss_kb, last_.anon_kb, last_.descriptors, last_.threads);
+  if (overruns_ > 0) printf("chaos: the kernel port's queue overflowed %ld times\n", overruns_);
   check(ok_, "the daemon ended only with the close's result, and settled each time");
   check(faults > 0 && commands_ > 0 && slowest_ms_ <= static_cast<double>(bound.count()),
         "every command done within the scaled wait and the margin");
