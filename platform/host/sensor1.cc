@@ -164,9 +164,16 @@ const char* op_name(FaultOp op) {
   return kNames[static_cast<int>(op)];
 }
 
-// Runs h's callback on the library thread; a close of h waits until it has returned.
+// Runs h's callback on the library thread; a close of h waits until it has returned. The check
+// that h is not closed and the mark that its callback runs are one step under g_lock, so a close
+// that returns between the caller's own check and this one is never followed by a callback.
 void run_callback(Connection* h, sensor1_msg_header_s* hdr, int type, void* body) {
   pthread_mutex_lock(&g_lock);
+  if (h->state == LinkState::kClosed) {
+    pthread_mutex_unlock(&g_lock);
+    if (body != nullptr) release_body(body);
+    return;
+  }
   h->in_callback = true;
   pthread_mutex_unlock(&g_lock);
   h->cb(h->cb_data, hdr, type, body);
