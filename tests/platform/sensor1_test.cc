@@ -13,7 +13,6 @@
 #include "log_capture.h"
 #include "sensor1_recorder.h"
 #include "test_env.h"
-#include "tools/sim/healthy_phone.h"
 #include "tools/sim/simulator.h"
 
 namespace {
@@ -206,24 +205,3 @@ TEST_F(Sensor1Test, CallbackMayBlockCloseItsConnectionAndOpenAnother) {
 }
 
 }  // namespace
-
-// In process the phone answers on the caller's thread: a write returns with its response and
-// indication delivered, a FAULT applies at once, and a drop is the broken pipe.
-TEST(Sensor1InProcessTest, AnswersArriveBeforeTheWriteReturns) {
-  Simulator sim(Simulator::InProcess{}, true);
-  Sensor1Recorder rec;
-  sensor1_handle_s* h = nullptr;
-  ASSERT_EQ(rec.open(&h), 0);
-  ASSERT_EQ(write_request(h, {0, 11, 0, 6}, {20, 0, 0}), 0);
-  EXPECT_EQ(rec.summaries(),
-            (Strings{"1 [0 11 3 6] 000000", "2 [0 13 84 6] 1400000003" + std::string(158, '0')}));
-  ASSERT_TRUE(sim.fault(FaultOp::kWrite, 5, 1));
-  void* left = nullptr;
-  EXPECT_EQ(write_request(h, {0, 11, 0, 6}, {20, 0, 0}, &left), 5);
-  sensor1_free_msg_buf(h, left);
-  sim.drop_connection();
-  EXPECT_EQ(rec.summaries().back(), "250 [0 0 0 0] no body");
-  EXPECT_EQ(sensor1_close(h), 0);
-  EXPECT_EQ(sim.phone().bad_requests(), 0u);
-  EXPECT_EQ(sensor1_host_outstanding_bodies(), 0);
-}

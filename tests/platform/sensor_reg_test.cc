@@ -1,13 +1,11 @@
-// The sensors-registry stand-in on its own: the file format, the per-version count of failed
-// opens, the malloc'ed copies it hands over, its log lines, and the parser's tolerance of input
-// that is not a registry.
+// The sensors-registry stand-in on its own: the file format, the malloc'ed copies it hands over,
+// its log lines, and the parser's tolerance of input that is not a registry.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <stdlib.h>
 #include <sys/stat.h>
 
 #include <string>
-#include <tuple>
 #include <vector>
 
 #include "log_capture.h"
@@ -55,23 +53,6 @@ TEST(SensorRegTest, ServesItemsErrorsAndCloseResultWithOneLinePerCall) {
             (std::vector<std::string>{"open -> 0", "read 406 -> 0 len 4", "read 407 -> 0 len 0",
                                       "read 409 -> 0 len 7", "read 119 -> 5 len 0",
                                       "read 1 -> -1 len 0", "close -> 7", "read 406 -> -1 len 0"}));
-}
-
-// Rewriting the file starts the count again: the same text under a new modification time,
-// and new text under the same one, are new versions. A failed open serves nothing.
-TEST(SensorRegTest, FailedOpensAreCountedPerVersionOfTheFile) {
-  const std::tuple<std::string, long, std::vector<int>, std::string> versions[] = {
-      {"open_failures = 2\n0 = 01\n", 1000, {-1, -1, 0, 0}, "0 01"},
-      {"open_failures = 2\n0 = 01\n", 2000, {-1, -1, 0}, "0 01"},
-      {"open_failures = 1\n0 = 02\n", 2000, {-1, 0, 0}, "0 02"}};
-  for (const auto& [text, mtime, results, item] : versions) {
-    write_registry(text, mtime);
-    for (const int result : results) {
-      EXPECT_EQ(sensor_reg_open(), result) << text << " at " << mtime;
-      EXPECT_EQ(read_item(0), result == 0 ? item : "-1 -");
-      sensor_reg_close();
-    }
-  }
 }
 
 // Lines that are not a registry's are ignored as a whole, each on its own and around good ones.

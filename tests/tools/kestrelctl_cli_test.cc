@@ -72,12 +72,12 @@ TEST_F(KestrelctlCli, AReplyIsDecodedAndNoReplyIsExitOne) {
   EXPECT_EQ(r.err, "kestrelctl: no reply (frame type 5) from kestreld within 0.2 s\n");
 }
 
-// The frame of each command that only sends (bulk data without its alignment bytes), from
-// a port of its own: the kernel's is left to a listener elsewhere.
-TEST_F(KestrelctlCli, SendOnlyCommandsBuildTheirFrames) {
+// Each command that only sends, from a port of its own (the kernel's is left to a listener
+// elsewhere): its frame (bulk data without its alignment bytes) and what it prints when checked.
+// A usage error (no frame) is exit 2 and sends nothing.
+TEST_F(KestrelctlCli, EachCommandSendsItsFrameOrIsAUsageError) {
   KernelPort listener;  // a `kestrelctl listen` elsewhere
   ASSERT_TRUE(listener.open_bound(100));
-  // The arguments, the frame and what the command prints, when checked.
   const std::tuple<std::string, Bytes, std::string> cases[] = {
       // clang-format off
       {"send 8 0x10 -1", build_command(8, {16, -1}),
@@ -92,14 +92,32 @@ TEST_F(KestrelctlCli, SendOnlyCommandsBuildTheirFrames) {
       {"diag stop", build_command(27, {0, 1}), ""},
       {"diag states", build_command(27, {0, 2}), ""},
       {"selftest light", build_command(8, {4}), ""},  // which the daemon never answers
+      {"", {}, "no command"},
+      {"status gyro2", {}, "'gyro2' is no sensor: use accel, gyro, mag, pressure, light, "
+                           "light-short or a sensor_type number"},
+      {"bigdata 27 00", {}, "command 27 is no bulk-data command: use 22 to 26, 28, 29, 31 or 32"},
+      {"bigdata 22 " + std::string(514, '0'), {},
+       "bulk data of 257 bytes: the driver takes at most 256 (send anything else with raw)"},
+      {"send 65536", {}, "command 65536 does not fit the 16-bit nlmsg_type"},
+      {"raw 123", {}, "raw: odd number of hex digits"},
+      {"calib read accel --flag 1", {}, "--flag applies to calib store only"},
+      {"status accel --timeout 0", {}, "--timeout needs a number of seconds above 0, not '0'"},
+      {"--verbose status accel", {}, "unknown option --verbose"},
       // clang-format on
   };
-  for (const auto& [args, frame, out] : cases) {
+  for (const auto& [args, frame, text] : cases) {
     const Result r = start(args).get();  // exit 3 if it took the kernel's port
+    if (frame.empty()) {
+      EXPECT_EQ(r.status, 2) << args;
+      EXPECT_EQ(r.err, "kestrelctl: " + text + "\nRun 'kestrelctl --help' for the commands.\n");
+      EXPECT_EQ(r.out, "");
+      continue;
+    }
     EXPECT_EQ(r.status, 0) << args << r.err;
-    EXPECT_TRUE(out.empty() || r.out == out) << r.out;
+    EXPECT_TRUE(text.empty() || r.out == text) << r.out;
     EXPECT_EQ(command().raw, Bytes(frame.begin(), frame.begin() + load_u32(frame.data(), 0)));
   }
+  EXPECT_TRUE(daemon.drain(std::chrono::milliseconds(50)).empty());
 }
 
 TEST(KestrelctlChannel, PortInUseAndNoDaemonAreExitThree) {
@@ -113,31 +131,6 @@ TEST(KestrelctlChannel, PortInUseAndNoDaemonAreExitThree) {
   EXPECT_EQ(r.err,
             "kestrelctl: nothing listens on netlink port 20000: is kestreld running (in this "
             "network namespace)?\n");
-}
-
-TEST_F(KestrelctlCli, UsageErrorsAreExitTwoAndSendNothing) {
-  const std::pair<std::string, std::string> cases[] = {
-      // clang-format off
-      {"", "no command"},
-      {"status gyro2", "'gyro2' is no sensor: use accel, gyro, mag, pressure, light, light-short "
-                       "or a sensor_type number"},
-      {"bigdata 27 00", "command 27 is no bulk-data command: use 22 to 26, 28, 29, 31 or 32"},
-      {"bigdata 22 " + std::string(514, '0'),
-       "bulk data of 257 bytes: the driver takes at most 256 (send anything else with raw)"},
-      {"send 65536", "command 65536 does not fit the 16-bit nlmsg_type"},
-      {"raw 123", "raw: odd number of hex digits"},
-      {"calib read accel --flag 1", "--flag applies to calib store only"},
-      {"status accel --timeout 0", "--timeout needs a number of seconds above 0, not '0'"},
-      {"--verbose status accel", "unknown option --verbose"},
-      // clang-format on
-  };
-  for (const auto& [args, message] : cases) {
-    const Result r = start(args).get();
-    EXPECT_EQ(r.status, 2) << args;
-    EXPECT_EQ(r.err, "kestrelctl: " + message + "\nRun 'kestrelctl --help' for the commands.\n");
-    EXPECT_EQ(r.out, "");
-  }
-  EXPECT_TRUE(daemon.drain(std::chrono::milliseconds(50)).empty());
 }
 
 }  // namespace
