@@ -12,16 +12,9 @@
 #include "daemon_fixture.h"
 #include "diag/diag_logging.h"
 
-using Lines = std::vector<std::string>;
-
 inline const std::string kStart =
     "diag_mdlog -f /system/etc/Diag_Sensor.cfg -p 16 -o /data/log -n 3 -s 1 -c";
 inline const std::string kStop = "diag_mdlog -k -p 16";
-
-inline Lines operator+(Lines a, const Lines& b) {
-  a.insert(a.end(), b.begin(), b.end());
-  return a;
-}
 
 // "<priority letter> <message>" of every libdiag call ("I libdiag: ...") unless left out, and of
 // the daemon's records that start with one of prefixes, in the order they were logged.

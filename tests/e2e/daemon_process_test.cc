@@ -33,12 +33,6 @@ using kestrelctl::build_frame;
 using kestrelctl::Frame;
 using kestrelctl::KernelPort;
 using ::testing::ElementsAre;
-using Lines = std::vector<std::string>;
-
-Lines operator+(Lines a, const Lines& b) {
-  a.insert(a.end(), b.begin(), b.end());
-  return a;
-}
 
 const char kStartTool[] =
     "diag_mdlog -f /system/etc/Diag_Sensor.cfg -p 16 -o /data/log -n 3 -s 1 -c";

@@ -17,7 +17,6 @@
 
 namespace {
 
-using kestrel_sim::FaultOp;
 using kestrel_sim::Simulator;
 using Bytes = std::vector<uint8_t>;
 using Strings = std::vector<std::string>;
@@ -60,16 +59,9 @@ class Sensor1Test : public ::testing::Test {
   std::vector<sensor1_handle_s*> to_close;
 };
 
-TEST_F(Sensor1Test, OpensAreRefusedUntilTheServiceAcceptsAndClosedHandlesAreRefused) {
+// Refused opens are driven through the daemon's reopen tries; here, what a connection refuses.
+TEST_F(Sensor1Test, BadWritesAndClosedHandlesAreRefused) {
   sensor1_handle_s* h = nullptr;
-  for (const int refused : {11, 5}) {
-    sim->refuse_opens(refused, 1);
-    EXPECT_EQ(rec.open(&h), refused);
-  }
-  sim->stop_listening();  // no socket file
-  EXPECT_EQ(rec.open(&h), 11);
-  EXPECT_EQ(h, nullptr);
-  sim->resume_listening();
   ASSERT_EQ(rec.open(&h), 0);
 
   sensor1_msg_header_s hdr{0, 13, 4, 4};
@@ -79,8 +71,7 @@ TEST_F(Sensor1Test, OpensAreRefusedUntilTheServiceAcceptsAndClosedHandlesAreRefu
   EXPECT_TRUE(sim->wait_for_disconnect(2s));
   expect_refused(h, SENSOR1_HOST_EINVAL);
   expect_refused(nullptr, SENSOR1_HOST_EINVAL);
-  EXPECT_EQ(lines(), (Strings{"open -> 11", "open -> 5", "open -> 11", "open -> 0", "close -> 0",
-                              "close -> 22", "close -> 22"}));
+  EXPECT_EQ(lines(), (Strings{"open -> 0", "close -> 0", "close -> 22", "close -> 22"}));
   EXPECT_TRUE(rec.deliveries().empty()) << "a close by the daemon is no broken pipe";
 }
 
@@ -143,35 +134,6 @@ TEST_F(Sensor1Test, EveryMessageKindReachesTheCallbackInOrderAndEndOfFileOnce) {
                      "2 [0 3 0 0] no body", "250 no header no body", "250 [0 0 0 0] no body"}));
   EXPECT_EQ(lines(),
             (Strings{"open -> 0", "connection ended, BROKEN_PIPE", "close -> 0", "open -> 0"}));
-}
-
-TEST_F(Sensor1Test, FaultsOfWriteAllocAndClose) {
-  sensor1_handle_s* h = open(rec);
-  // 11: sent all the same, the body taken by the library; another value: nothing sent, the
-  // body still the caller's.
-  ASSERT_TRUE(sim->fault(FaultOp::kWrite, 11, 1));
-  EXPECT_EQ(write_request(h, {0, 13, 0, 4}, {1}), 11);
-  ASSERT_TRUE(sim->fault(FaultOp::kWrite, 5, 1));
-  void* left = nullptr;
-  EXPECT_EQ(write_request(h, {0, 13, 0, 4}, {2}, &left), 5);
-  EXPECT_EQ(sensor1_host_outstanding_bodies(), 1);
-  sensor1_free_msg_buf(h, left);
-
-  ASSERT_TRUE(sim->fault(FaultOp::kAlloc, 12, 2));
-  void* buf = reinterpret_cast<void*>(1);
-  EXPECT_EQ(sensor1_alloc_msg_buf(h, 12, &buf), 12);
-  EXPECT_EQ(sensor1_alloc_msg_buf(h, 12, &buf), 12);
-  EXPECT_EQ(buf, nullptr);
-  EXPECT_EQ(write_request(h, {0, 13, 0, 4}, {3}), 0);  // the third alloc succeeds
-  ASSERT_TRUE(sim->next_request(2s) && sim->next_request(2s));
-  EXPECT_EQ(sim->requests()[1].body, Bytes{3}) << "the refused write was sent";
-
-  ASSERT_TRUE(sim->fault(FaultOp::kClose, 9, 1));
-  EXPECT_EQ(sensor1_close(h), 9);  // and closed all the same
-  expect_refused(h, SENSOR1_HOST_EINVAL);
-  EXPECT_EQ(lines(), (Strings{"open -> 0", "fault write -> 11 count 1", "fault write -> 5 count 1",
-                              "fault alloc -> 12 count 2", "fault close -> 9 count 1", "close -> 9",
-                              "close -> 22"}));
 }
 
 // A callback may block, close its own connection and open another. While the blocker's callback

@@ -1,32 +1,26 @@
 // The service callback reached as the library reaches it, from any of the test's threads, with
-// the daemon's records and frames at hand and the recording shell tools first on PATH.
+// the daemon's records and frames at hand, on the DIAG tests' fixture (recording shell tools first
+// on PATH, no properties).
 #pragma once
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <stdlib.h>
 #include <string.h>
 
 #include <string>
 #include <utility>
 #include <vector>
 
-#include "daemon_fixture.h"
 #include "sensor1_host.h"
 #include "service_link/connection.h"
 #include "service_link/service_callback.h"
+#include "tests/diag/diag_fixture.h"
 
 using Bytes = std::vector<uint8_t>;
 using Logged = std::pair<int, std::string>;  // priority, message
 
-class CallbackTest : public DaemonFixture {
+class CallbackTest : public DiagTest {
  protected:
-  void SetUp() override {
-    DaemonFixture::SetUp();
-    static const std::string path = getenv("PATH");
-    setenv("PATH", (tools.dir() + ":" + path).c_str(), 1);
-    write_file(test_properties_path(), "");
-  }
   // A body from the library's allocator whose size is the header's msg_size; empty means null.
   static void deliver(int type, uint32_t service, int32_t msg_id, uint8_t txn, const Bytes& body) {
     sensor1_msg_header_s hdr = {service, msg_id, static_cast<uint16_t>(body.size()), txn};
@@ -48,6 +42,4 @@ class CallbackTest : public DaemonFixture {
     EXPECT_TRUE(f) << "no frame of type " << type;
     return f ? f->payload : Bytes{};
   }
-
-  FakeTools tools;
 };

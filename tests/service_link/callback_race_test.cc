@@ -19,8 +19,6 @@ using namespace kestrel_sim;
 
 namespace {
 
-using Lines = std::vector<std::string>;
-
 constexpr char kLastLine[] = "rcv_test_msg hh_read_data_thread success\n";
 constexpr char kRefresh[] = "rcv_test_msg read/update light coef efs file in broken pipe\n";
 

@@ -5,6 +5,13 @@
 #include <string>
 #include <vector>
 
+// Log lines in order; a + b is a followed by b.
+using Lines = std::vector<std::string>;
+inline Lines operator+(Lines a, const Lines& b) {
+  a.insert(a.end(), b.begin(), b.end());
+  return a;
+}
+
 struct LogRecord {
   int priority;  // 4 info, 5 warning, 6 error
   std::string tag;

@@ -32,12 +32,6 @@ using kestrel_sim::Request;
 using kestrel_sim::Simulator;
 using ::testing::ElementsAre;
 using ::testing::ElementsAreArray;
-using Lines = std::vector<std::string>;
-
-inline Lines operator+(Lines a, const Lines& b) {
-  a.insert(a.end(), b.begin(), b.end());
-  return a;
-}
 
 template <typename T>
 void put(Bytes& b, size_t offset, T v) {
