@@ -12,10 +12,6 @@
 #include "daemon_fixture.h"
 #include "diag/diag_logging.h"
 
-inline const std::string kStart =
-    "diag_mdlog -f /system/etc/Diag_Sensor.cfg -p 16 -o /data/log -n 3 -s 1 -c";
-inline const std::string kStop = "diag_mdlog -k -p 16";
-
 // "<priority letter> <message>" of every libdiag call ("I libdiag: ...") unless left out, and of
 // the daemon's records that start with one of prefixes, in the order they were logged.
 inline Lines view(const std::vector<LogRecord>& records,

@@ -34,10 +34,6 @@ using kestrelctl::Frame;
 using kestrelctl::KernelPort;
 using ::testing::ElementsAre;
 
-const char kStartTool[] =
-    "diag_mdlog -f /system/etc/Diag_Sensor.cfg -p 16 -o /data/log -n 3 -s 1 -c";
-const char kStopTool[] = "diag_mdlog -k -p 16";
-
 // Threads of a process (entries of /proc/<pid>/task); waits until there are n.
 bool wait_for_tasks(pid_t pid, int n, std::chrono::milliseconds timeout) {
   const auto deadline = std::chrono::steady_clock::now() + timeout;
@@ -250,11 +246,6 @@ TEST(DaemonProcessTest, StartUpFailuresEndTheProcessWithTheirStatus) {
   }
 }
 
-Bytes concat(Bytes a, const Bytes& b) {
-  a.insert(a.end(), b.begin(), b.end());
-  return a;
-}
-
 TEST(DaemonProcessTest, TheReceiveLoopWalksEachDatagramByTheNetlinkRules) {
   Rig rig;
   rig.start();
@@ -262,22 +253,22 @@ TEST(DaemonProcessTest, TheReceiveLoopWalksEachDatagramByTheNetlinkRules) {
   Bytes full;  // 64 frames fill the receive buffer
   Lines full_walk;
   for (int i = 0; i < 64; ++i) {
-    full = concat(full, build_command(static_cast<uint16_t>(40 + i)));
+    full = full + build_command(static_cast<uint16_t>(40 + i));
     full_walk.push_back(pm(40 + i));
   }
   const std::string malformed = "process_message: malformed netlink message\n";
   const std::pair<Bytes, Lines> cases[] = {
       {Bytes(15, 0xff), walked(15, {})},  // under a header's worth of bytes
-      {concat(build_command(2, {7}), build_command(5)), walked(36, {pm(2), pm(5)})},
+      {build_command(2, {7}) + build_command(5), walked(36, {pm(2), pm(5)})},
       // nlmsg_len 17 in an 18-byte datagram: handled; its aligned length (20) ends the walk.
       {build_frame(7, {0xAA, 0xBB}, 17), walked(18, {pm(7)})},
       // nlmsg_len below a header or beyond the datagram: the rest is dropped.
       {build_frame(2, {}, 0), walked(16, {malformed})},
-      {concat(build_command(9), build_frame(2, {1, 2, 3, 4}, 24)), walked(36, {pm(9), malformed})},
+      {build_command(9) + build_frame(2, {1, 2, 3, 4}, 24), walked(36, {pm(9), malformed})},
       {build_command(65535), walked(16, {pm(65535)})},  // numbers above 36 are only logged
       {full, walked(1024, full_walk)},
       // Frames too short for their command's fields are refused; the walk goes on.
-      {concat(build_command(0), build_command(9)),
+      {build_command(0) + build_command(9),
        walked(32, {pm(0),
                    "process_message: NETLINK_MESSAGE_GET_STATUS refused: frame of 16 bytes, "
                    "needs 20",
@@ -353,7 +344,7 @@ TEST(DaemonProcessTest, ABrokenLinkWithTheServiceGoneMakesThreeReopenTries) {
   EXPECT_GT(tries, 350ms) << "two more tries";
   EXPECT_LT(tries, 550ms) << "not three";
   EXPECT_EQ(opens_only(rig.thread_lines_from("BROKEN_PIPE sensor1_handle")), fifty_refused_opens());
-  EXPECT_EQ(rig.tools.calls(), Lines({kStartTool, kStopTool})) << "logging stopped with the link";
+  EXPECT_EQ(rig.tools.calls(), Lines({kStart, kStop})) << "logging stopped with the link";
   const std::optional<Frame> refresh = rig.kernel->next_frame_of_type(34, 10s);
   ASSERT_TRUE(refresh) << "a new refresh thread runs";
   EXPECT_EQ(refresh->raw, daemon_frame(34, {0x04, 0x01}));

@@ -5,9 +5,10 @@
 #include <string>
 #include <vector>
 
-// Log lines in order; a + b is a followed by b.
+// Log lines in order. a + b is a followed by b, for lines and for bytes alike.
 using Lines = std::vector<std::string>;
-inline Lines operator+(Lines a, const Lines& b) {
+template <typename T>
+std::vector<T> operator+(std::vector<T> a, const std::vector<T>& b) {
   a.insert(a.end(), b.begin(), b.end());
   return a;
 }

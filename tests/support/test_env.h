@@ -35,3 +35,8 @@ class FakeTools {
  private:
   std::string dir_;
 };
+
+// The tool calls that start and stop DIAG logging.
+inline const std::string kStart =
+    "diag_mdlog -f /system/etc/Diag_Sensor.cfg -p 16 -o /data/log -n 3 -s 1 -c";
+inline const std::string kStop = "diag_mdlog -k -p 16";
