@@ -59,10 +59,7 @@ class DiagTest : public DaemonFixture {
   }
   // The dump thread sets the state last, right before it ends.
   static bool wait_for_state(int32_t value) {
-    for (int i = 0; i < 4000 && diag_logging_state() != value; ++i) {
-      std::this_thread::sleep_for(5ms);
-    }
-    return diag_logging_state() == value;
+    return eventually([=] { return diag_logging_state() == value; }, 20000ms);
   }
 
   FakeTools tools;

@@ -36,17 +36,16 @@ using ::testing::ElementsAre;
 
 // Threads of a process (entries of /proc/<pid>/task); waits until there are n.
 bool wait_for_tasks(pid_t pid, int n, std::chrono::milliseconds timeout) {
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  for (;;) {
-    int count = 0;
-    if (DIR* dir = opendir(("/proc/" + std::to_string(pid) + "/task").c_str())) {
-      while (struct dirent* e = readdir(dir)) count += e->d_name[0] != '.';
-      closedir(dir);
-    }
-    if (count == n) return true;
-    if (std::chrono::steady_clock::now() >= deadline) return false;
-    std::this_thread::sleep_for(2ms);
-  }
+  return eventually(
+      [&] {
+        int count = 0;
+        if (DIR* dir = opendir(("/proc/" + std::to_string(pid) + "/task").c_str())) {
+          while (struct dirent* e = readdir(dir)) count += e->d_name[0] != '.';
+          closedir(dir);
+        }
+        return count == n;
+      },
+      timeout);
 }
 
 // A running daemon with the kernel, the sensor processor and the shell tools around it.

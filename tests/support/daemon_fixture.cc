@@ -1,7 +1,5 @@
 #include "daemon_fixture.h"
 
-#include <thread>
-
 #include "diag/diag_logging.h"
 #include "kernel_channel/netlink_channel.h"
 #include "kernel_channel/process_message.h"
@@ -43,10 +41,8 @@ void DaemonFixture::TearDown() {
   set_netmgr_malloc_for_testing(nullptr);
   if (check_bodies_released) {
     // Bodies still in flight on the library's thread get a moment to be delivered and freed.
-    for (int i = 0; i < 100 && sensor1_host_outstanding_bodies() != 0; ++i) {
-      std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
-    EXPECT_EQ(sensor1_host_outstanding_bodies(), 0) << "a sensor1 body leaked";
+    EXPECT_TRUE(eventually([] { return sensor1_host_outstanding_bodies() == 0; }, 500ms))
+        << "a sensor1 body leaked";
   }
   kernel.reset();
   log.reset();

@@ -9,7 +9,8 @@
 
 #include <fstream>
 #include <sstream>
-#include <thread>
+
+#include "test_env.h"
 
 #ifndef KESTRELD_BINARY
 #error "KESTRELD_BINARY must name the daemon under test"
@@ -104,29 +105,26 @@ bool DaemonProcess::wait_for(const std::string& message, std::chrono::millisecon
                              size_t n, const std::string& tag) const {
   const std::string bare =
       !message.empty() && message.back() == '\n' ? message.substr(0, message.size() - 1) : message;
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  for (;;) {
-    size_t seen = 0;
-    for (const LogRecord& r : records()) {
-      seen += r.tag == tag && (r.message == message || r.message == bare);
-    }
-    if (seen >= n) return true;
-    if (std::chrono::steady_clock::now() >= deadline) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(2));
-  }
+  return eventually(
+      [&] {
+        size_t seen = 0;
+        for (const LogRecord& r : records()) {
+          seen += r.tag == tag && (r.message == message || r.message == bare);
+        }
+        return seen >= n;
+      },
+      timeout);
 }
 
 std::optional<int> DaemonProcess::wait_exit(std::chrono::milliseconds timeout) {
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  while (!status_) {
-    int status = 0;
-    if (waitpid(pid_, &status, WNOHANG) == pid_) {
-      status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status);
-    } else if (std::chrono::steady_clock::now() >= deadline) {
-      return std::nullopt;
-    } else {
-      std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
-  }
+  eventually(
+      [&] {
+        int status = 0;
+        if (!status_ && waitpid(pid_, &status, WNOHANG) == pid_) {
+          status_ = WIFEXITED(status) ? WEXITSTATUS(status) : -WTERMSIG(status);
+        }
+        return status_.has_value();
+      },
+      timeout);
   return status_;
 }

@@ -68,8 +68,8 @@ size_t LogCapture::count(const std::string& message, const std::string& tag) con
   return n;
 }
 
-bool LogCapture::wait_for(const std::string& message, std::chrono::milliseconds timeout,
-                          size_t n, const std::string& tag) const {
+bool LogCapture::wait_for(const std::string& message, std::chrono::milliseconds timeout, size_t n,
+                          const std::string& tag) const {
   std::unique_lock<std::mutex> lock(g_mutex);
   return g_cond.wait_for(lock, timeout, [&] {
     size_t seen = 0;

@@ -16,6 +16,7 @@
 
 #include "sensor1.h"
 #include "sensor1_host.h"
+#include "test_env.h"
 
 struct Delivery {
   int type = 0;
@@ -38,14 +39,6 @@ inline std::string summary(const Delivery& d) {
   static const char kHex[] = "0123456789abcdef";
   for (const uint8_t b : d.body) s += {kHex[b >> 4], kHex[b & 15]};
   return s;
-}
-
-// Polls done every 10 ms for up to 5 s; true once it holds.
-inline bool eventually(const std::function<bool()>& done) {
-  for (int i = 0; i < 500; ++i, std::this_thread::sleep_for(std::chrono::milliseconds(10))) {
-    if (done()) return true;
-  }
-  return false;
 }
 
 // One sensor1_write of body in a buffer of the library. When the write leaves the body to the

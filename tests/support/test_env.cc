@@ -71,11 +71,15 @@ std::vector<std::string> FakeTools::calls() const {
   return out;
 }
 
-bool FakeTools::wait_for_calls(size_t n, int timeout_ms) const {
-  const auto deadline = std::chrono::steady_clock::now() + std::chrono::milliseconds(timeout_ms);
-  while (calls().size() < n) {
+bool eventually(const std::function<bool()>& done, std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!done()) {
     if (std::chrono::steady_clock::now() >= deadline) return false;
-    std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
   }
   return true;
+}
+
+bool FakeTools::wait_for_calls(size_t n, int timeout_ms) const {
+  return eventually([&] { return calls().size() >= n; }, std::chrono::milliseconds(timeout_ms));
 }

@@ -6,6 +6,7 @@
 #pragma once
 
 #include <chrono>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -16,6 +17,11 @@ std::string test_sysroot();
 
 // A nominal duration at the time scale the tests run the daemon at (KESTREL_TIME_SCALE).
 std::chrono::milliseconds scaled(std::chrono::milliseconds nominal);
+
+// Polls done every 2 ms until it holds (true) or timeout has passed (false); done runs at least
+// once.
+bool eventually(const std::function<bool()>& done,
+                std::chrono::milliseconds timeout = std::chrono::seconds(5));
 
 // Writes a whole file (the parent directories are created).
 void write_file(const std::string& path, const std::string& text);

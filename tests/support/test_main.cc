@@ -17,8 +17,8 @@ int main(int argc, char** argv) {
   signal(SIGPIPE, SIG_IGN);
   testing::InitGoogleMock(&argc, argv);
   const int r = RUN_ALL_TESTS();
-  const std::string cleanup = "rm -rf " + base + ".sock " + base + ".props " + base + ".reg " +
-                              base + "-root";
+  const std::string cleanup =
+      "rm -rf " + base + ".sock " + base + ".props " + base + ".reg " + base + "-root";
   int ignored = system(cleanup.c_str());
   (void)ignored;
   return r;
