@@ -17,7 +17,7 @@ class CalibrationStoreTest : public RequestTest {
     Lines out;
     for (const LogRecord& r : log->records()) {
       if (r.message.find("store_calib_data") > 1) continue;
-      out.push_back((r.priority == 6 ? "E " : r.priority == 4 ? "I " : "? ") + r.message);
+      out.push_back(r.letter() + r.message);
     }
     return out;
   }

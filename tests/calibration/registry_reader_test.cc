@@ -48,10 +48,7 @@ class RegistryReaderTest : public RequestTest {
     for (const LogRecord& r : log->records()) {
       if (r.message.rfind("process_message", 0) == 0) continue;
       if (r.message != kSent) {
-        out.push_back((r.priority == 6   ? "E "
-                       : r.priority == 4 ? "I "
-                                         : "? ") +
-                      r.tag + " " + r.message);
+        out.push_back(r.letter() + r.tag + " " + r.message);
       } else if (out.empty() || out.back() != kSent) {
         out.push_back(kSent);
       }

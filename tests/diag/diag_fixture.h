@@ -20,7 +20,7 @@ inline Lines view(const std::vector<LogRecord>& records,
                   bool with_libdiag = true) {
   Lines out;
   for (const LogRecord& r : records) {
-    const std::string p = std::string(1, "??VDIWEF"[r.priority & 7]) + " ";
+    const std::string p = r.letter();
     if (r.tag == "libdiag" && with_libdiag) out.push_back(p + "libdiag: " + r.message);
     for (const std::string& prefix : prefixes) {
       if (r.tag == "KESTRELD" && r.message.rfind(prefix, 0) == 0) {

@@ -6,8 +6,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <fstream>
-
 #include "sensor1_recorder.h"
 #include "test_env.h"
 
@@ -18,10 +16,7 @@ TEST(KestrelSimTest, RefusesDropsAnswersAndStopsOnSigterm) {
   const std::string program = daemon.substr(0, daemon.rfind('/')) + "/tools/sim/kestrel-sim";
   const std::string out = test_sysroot() + "/kestrel-sim.out";  // removed with the sysroot
   write_file(out, "");
-  auto printed = [&] {
-    std::ifstream in(out);
-    return std::string(std::istreambuf_iterator<char>(in), {});
-  };
+  auto printed = [&] { return read_file(out); };
   struct Child {
     pid_t pid = fork();
     ~Child() {

@@ -7,7 +7,6 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <fstream>
 #include <sstream>
 
 #include "test_env.h"
@@ -60,10 +59,7 @@ DaemonProcess::~DaemonProcess() {
 }
 
 std::string DaemonProcess::output() const {
-  std::ifstream in(log_path_);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
+  return read_file(log_path_);
 }
 
 // A line "<tag> <P> <MM-DD> <HH:MM:SS> <pid> <tid> <message>" (pid and tid padded with blanks)

@@ -2,6 +2,7 @@
 
 #include <android/log.h>
 
+#include <algorithm>
 #include <atomic>
 #include <condition_variable>
 #include <mutex>
@@ -60,12 +61,8 @@ std::vector<std::string> LogCapture::messages(const std::string& tag) const {
 }
 
 size_t LogCapture::count(const std::string& message, const std::string& tag) const {
-  size_t n = 0;
-  std::lock_guard<std::mutex> lock(g_mutex);
-  for (const LogRecord& r : *g_records) {
-    if (r.tag == tag && r.message == message) ++n;
-  }
-  return n;
+  const std::vector<std::string> m = messages(tag);
+  return static_cast<size_t>(std::count(m.begin(), m.end(), message));
 }
 
 bool LogCapture::wait_for(const std::string& message, std::chrono::milliseconds timeout, size_t n,

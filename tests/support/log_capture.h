@@ -18,6 +18,8 @@ struct LogRecord {
   std::string tag;
   std::string message;
   long tid = 0;  // the writing thread, for a daemon run as a process
+  // "I ", "W ", "E "...: the priority's letter, as logcat shows it.
+  std::string letter() const { return {"??VDIWEF"[priority & 7], ' '}; }
 };
 
 // One at a time per process. Records of every thread are kept in order of logging.

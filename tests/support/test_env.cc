@@ -46,6 +46,11 @@ void remove_file(const std::string& path) {
   unlink(path.c_str());
 }
 
+std::string read_file(const std::string& path) {
+  std::ifstream in(path);
+  return std::string(std::istreambuf_iterator<char>(in), {});
+}
+
 FakeTools::FakeTools() {
   char tmpl[] = "/tmp/kestrel-tools-XXXXXX";
   dir_ = mkdtemp(tmpl);

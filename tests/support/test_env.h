@@ -26,6 +26,8 @@ bool eventually(const std::function<bool()>& done,
 // Writes a whole file (the parent directories are created).
 void write_file(const std::string& path, const std::string& text);
 void remove_file(const std::string& path);
+// A whole file's text ("" when it cannot be read).
+std::string read_file(const std::string& path);
 
 // Recording stand-ins for the shell tools the daemon runs: chown, chmod and diag_mdlog. Each
 // call appends "<tool> <args>" as one line to a record file. Put dir() first on PATH.

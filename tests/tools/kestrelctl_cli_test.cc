@@ -4,7 +4,6 @@
 #include <stdlib.h>
 #include <sys/wait.h>
 
-#include <fstream>
 #include <future>
 #include <string>
 #include <tuple>
@@ -28,10 +27,8 @@ std::future<Result> start(const std::string& args) {
   return std::async(std::launch::async, [=] {
     const int status =
         system((KESTRELCTL_BINARY " " + args + " >" + out + ".out 2>" + out + ".err").c_str());
-    std::ifstream o(out + ".out"), e(out + ".err");
-    const Result r{WIFEXITED(status) ? WEXITSTATUS(status) : -1,
-                   std::string(std::istreambuf_iterator<char>(o), {}),
-                   std::string(std::istreambuf_iterator<char>(e), {})};
+    const Result r{WIFEXITED(status) ? WEXITSTATUS(status) : -1, read_file(out + ".out"),
+                   read_file(out + ".err")};
     system(("rm -f " + out + ".out " + out + ".err").c_str());
     return r;
   });
