@@ -3,15 +3,12 @@
 #include <android/log.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <stdlib.h>
 
 #include <mutex>
 #include <string>
 #include <vector>
 
-#include "kernel_channel/process_message.h"
-#include "kernel_port.h"
-#include "test_env.h"
+#include "tests/diag/diag_fixture.h"
 
 using ::testing::ElementsAre;
 
@@ -28,17 +25,13 @@ void recording_logger(const struct __android_logger_data* data, const char* mess
   g_lines.emplace_back(message, g_tools->calls().size());
 }
 
-TEST(HhFilePermissionsTest, RunsTheFourCommandsInOrderBetweenItsLines) {
-  FakeTools tools;
-  g_tools = &tools;
-  const std::string path = tools.dir() + ":" + getenv("PATH");
-  setenv("PATH", path.c_str(), 1);
-  __android_log_set_logger(recording_logger);
+// On the fixture whose recording tools are first on PATH.
+using HhFilePermissionsTest = DiagTest;
 
-  const std::vector<uint8_t> frame = kestrelctl::build_command(36);
-  std::vector<uint8_t> buffer(1024, 0);
-  std::copy(frame.begin(), frame.end(), buffer.begin());
-  process_message(buffer.data(), static_cast<int32_t>(frame.size()));
+TEST_F(HhFilePermissionsTest, RunsTheFourCommandsInOrderBetweenItsLines) {
+  g_tools = &tools;
+  __android_log_set_logger(recording_logger);
+  command(36);
 
   __android_log_set_logger(__android_log_stderr_logger);
   EXPECT_THAT(tools.calls(), ElementsAre("chown system:radio /efs/FactoryApp/predefine*",

@@ -10,6 +10,7 @@
 #include <future>
 #include <memory>
 
+#include "daemon_frames.h"
 #include "log_capture.h"
 #include "sensor1_recorder.h"
 #include "test_env.h"
@@ -18,8 +19,6 @@
 namespace {
 
 using kestrel_sim::Simulator;
-using Bytes = std::vector<uint8_t>;
-using Strings = std::vector<std::string>;
 using std::chrono_literals::operator""s;
 
 class Sensor1Test : public ::testing::Test {
@@ -51,7 +50,7 @@ class Sensor1Test : public ::testing::Test {
     EXPECT_EQ(sensor1_close(h), result == SENSOR1_HOST_EPIPE ? 0 : result);
   }
 
-  Strings lines() const { return log.messages("libsensor1"); }
+  Lines lines() const { return log.messages("libsensor1"); }
 
   LogCapture log;
   std::unique_ptr<Simulator> sim = std::make_unique<Simulator>(test_socket_path());
@@ -71,7 +70,7 @@ TEST_F(Sensor1Test, BadWritesAndClosedHandlesAreRefused) {
   EXPECT_TRUE(sim->wait_for_disconnect(2s));
   expect_refused(h, SENSOR1_HOST_EINVAL);
   expect_refused(nullptr, SENSOR1_HOST_EINVAL);
-  EXPECT_EQ(lines(), (Strings{"open -> 0", "close -> 0", "close -> 22", "close -> 22"}));
+  EXPECT_EQ(lines(), (Lines{"open -> 0", "close -> 0", "close -> 22", "close -> 22"}));
   EXPECT_TRUE(rec.deliveries().empty()) << "a close by the daemon is no broken pipe";
 }
 
@@ -99,7 +98,7 @@ TEST_F(Sensor1Test, RecordsOnTheWireAreByteExact) {
   ASSERT_EQ(opened.get(), 0);
   to_close.push_back(h);
   ASSERT_TRUE(rec.wait_for(1));
-  EXPECT_EQ(rec.summaries(), Strings{"1 [0 11 2 6] 0700"});
+  EXPECT_EQ(rec.summaries(), Lines{"1 [0 11 2 6] 0700"});
 
   // A write: header fields little-endian, the signed msg_id included, then the body.
   EXPECT_EQ(write_request(h, {44, -2, 0, 169}, {0xAA, 0x01, 0xFF}), 0);
@@ -116,8 +115,8 @@ TEST_F(Sensor1Test, AnEndedConnectionRefusesWithABrokenPipe) {
   sim->drop_connection();
   ASSERT_TRUE(rec.wait_for(1));
   expect_refused(h, SENSOR1_HOST_EPIPE);
-  EXPECT_EQ(rec.summaries(), Strings{"250 [0 0 0 0] no body"});
-  EXPECT_EQ(lines(), (Strings{"open -> 0", "connection ended, BROKEN_PIPE", "close -> 0"}));
+  EXPECT_EQ(rec.summaries(), Lines{"250 [0 0 0 0] no body"});
+  EXPECT_EQ(lines(), (Lines{"open -> 0", "connection ended, BROKEN_PIPE", "close -> 0"}));
 }
 
 // A callback may block, close its own connection and open another. While the blocker's callback
@@ -145,9 +144,9 @@ TEST_F(Sensor1Test, CallbackMayBlockCloseItsConnectionAndOpenAnother) {
   to_close.push_back(b);
   sim->respond({0, 64, 0, 0}, {7});  // to b, the current connection
   ASSERT_TRUE(second.wait_for(1));
-  EXPECT_EQ(first.summaries(), Strings{"2 [0 13 1 4] 01"});
-  EXPECT_EQ(second.summaries(), Strings{"1 [0 64 1 0] 07"});
-  EXPECT_EQ(lines(), (Strings{"open -> 0", "open -> 0", "close -> 0", "open -> 0"}));
+  EXPECT_EQ(first.summaries(), Lines{"2 [0 13 1 4] 01"});
+  EXPECT_EQ(second.summaries(), Lines{"1 [0 64 1 0] 07"});
+  EXPECT_EQ(lines(), (Lines{"open -> 0", "open -> 0", "close -> 0", "open -> 0"}));
 }
 
 }  // namespace

@@ -11,12 +11,12 @@
 #include <utility>
 #include <vector>
 
+#include "daemon_frames.h"
 #include "sensor1_host.h"
 #include "service_link/connection.h"
 #include "service_link/service_callback.h"
 #include "tests/diag/diag_fixture.h"
 
-using Bytes = std::vector<uint8_t>;
 using Logged = std::pair<int, std::string>;  // priority, message
 
 class CallbackTest : public DiagTest {
@@ -36,10 +36,5 @@ class CallbackTest : public DiagTest {
     }
     log->clear();
     return out;
-  }
-  Bytes payload(uint16_t type) {
-    auto f = kernel->next_frame_of_type(type, 5000ms);
-    EXPECT_TRUE(f) << "no frame of type " << type;
-    return f ? f->payload : Bytes{};
   }
 };

@@ -39,7 +39,7 @@ class CallbackThreadsTest : public CallbackTest {
   // reports its start.
   Lines recovery_lines() {
     EXPECT_TRUE(log->wait_for(kLastLine, 5000ms));
-    EXPECT_THAT(payload(34), ElementsAre(4, 1, 0, 0));
+    EXPECT_THAT(frame(34, true), ElementsAre(4, 1, 0, 0));
     Lines out = lines();
     out.erase(std::remove(out.begin(), out.end(), "hh_read_data_thread start\n"), out.end());
     return out;
@@ -151,16 +151,16 @@ TEST_F(CallbackThreadsTest, DumpsFromSeveralThreadsKeepFrameAndLinesTogether) {
   // in the frames' order.
   Lines expected;
   for (int d = 0; d < 3 * kRounds; ++d) {
-    const Bytes frame = payload(20);
-    ASSERT_EQ(frame.size(), 132u);
-    const Bytes body = dump_body(frame[0], frame[1] & 0x1f);
-    EXPECT_TRUE(std::equal(frame.begin() + 1, frame.end(), body.begin() + 12)) << "frame " << d;
-    const std::string dump = "+++++++++++ Print Register Dump for " + std::to_string(frame[0]);
+    const Bytes got = frame(20, true);
+    ASSERT_EQ(got.size(), 132u);
+    const Bytes body = dump_body(got[0], got[1] & 0x1f);
+    EXPECT_TRUE(std::equal(got.begin() + 1, got.end(), body.begin() + 12)) << "frame " << d;
+    const std::string dump = "+++++++++++ Print Register Dump for " + std::to_string(got[0]);
     expected.push_back(dump + " Start +++++++++++");
     for (unsigned r = 0; r < 128; ++r) {
       char line[64];
       snprintf(line, sizeof line, "+++++++++++ Reg_addr[0x%2x] : value[0x%2x] +++++++++++",
-               (frame[0] >= 4 ? 0x80 : 0) + r, unsigned{body[12 + r]});
+               (got[0] >= 4 ? 0x80 : 0) + r, unsigned{body[12 + r]});
       expected.push_back(line);
     }
     expected.push_back(dump + " End +++++++++++");

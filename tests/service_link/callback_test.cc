@@ -51,9 +51,11 @@ TEST_F(CallbackTest, EntryRulesAndResponsesLoggedOrRelayed) {
   for (auto [at, v] : {std::pair{12, 5}, {16, -3}, {20, 7}, {24, -9}})
     memcpy(&threshold[at], &v, 4);
   deliver(1, 44, 32, 167, resized(threshold, 20));
-  EXPECT_THAT(payload(30), ElementsAre(5, 0, 0, 0, 0xfd, 0xff, 0xff, 0xff, 0, 0, 0, 0, 0, 0, 0, 0));
+  EXPECT_THAT(frame(30, true),
+              ElementsAre(5, 0, 0, 0, 0xfd, 0xff, 0xff, 0xff, 0, 0, 0, 0, 0, 0, 0, 0));
   deliver(1, 44, 32, 168, threshold);
-  EXPECT_THAT(payload(33), ElementsAre(0, 0, 0, 0, 0, 0, 0, 0, 7, 0, 0, 0, 0xf7, 0xff, 0xff, 0xff));
+  EXPECT_THAT(frame(33, true),
+              ElementsAre(0, 0, 0, 0, 0, 0, 0, 0, 7, 0, 0, 0, 0xf7, 0xff, 0xff, 0xff));
 
   const Bytes report = {0, 0, 0, 0, 0, 0, 0, 0, 20};
   deliver(1, 0, 38, 0, {1, 4});
@@ -133,21 +135,21 @@ TEST_F(CallbackTest, SamplesAndDafDataGoOutAsFramesOfTypeTwo) {
   // The magnetometer, each axis by its own sensitivity: 666 for 1.0, 1333 for 0.5, 2666 for 0.25.
   set_mag_sensitivity(0.5f, 1.0f, 0.25f);
   deliver(2, 0, 3, 0, sample_indication_body(20, 0, 65536, 65536, 65536));
-  EXPECT_THAT(payload(2),
+  EXPECT_THAT(frame(2, true),
               ElementsAre(2, 0, 0, 0, 0x9a, 0x02, 0x35, 0x05, 0x96, 0xf5, 0, 0, 0, 0, 0, 0));
   const std::array<int32_t, 6> d = {10, 11, 12, 13, 70000, -2};
   deliver(2, 44, 33, 0, daf_indication_body(61, 1, 24, d));
-  EXPECT_THAT(payload(2),
+  EXPECT_THAT(frame(2, true),
               ElementsAre(4, 0, 0, 0, 11, 0, 12, 0, 13, 0, 10, 0, 0x70, 0x11, 0xfe, 0xff));
   deliver(2, 44, 33, 0, daf_indication_body(51, 1, 8, d));
-  EXPECT_THAT(payload(2), ElementsAre(5, 0, 0, 0, 10, 0, 11, 0, 0, 0, 0, 0, 0, 0, 0, 0));
+  EXPECT_THAT(frame(2, true), ElementsAre(5, 0, 0, 0, 10, 0, 11, 0, 0, 0, 0, 0, 0, 0, 0, 0));
   EXPECT_THAT(logged(), IsEmpty());
 
   // Invalid or short DAF data, or another code: logged (or not), and an empty frame all the same.
   deliver(2, 44, 33, 0, daf_indication_body(61, 1, 20, d));
   deliver(2, 44, 33, 0, daf_indication_body(51, 0, 8, d));
   deliver(2, 44, 33, 0, daf_indication_body(99, 1, 24, d));
-  for (int i = 0; i < 3; ++i) EXPECT_THAT(payload(2), Each(0));
+  for (int i = 0; i < 3; ++i) EXPECT_THAT(frame(2, true), Each(0));
   EXPECT_THAT(logged(), ElementsAre(Logged{6,
                                            "[DAF]daf_test: Unexpected error when parsing DAF ALS "
                                            "& RGB Polling IndicationMsg! valid 1 len 20\n"},

@@ -29,6 +29,12 @@ class DaemonFixture : public ::testing::Test {
   // One command frame with payload words.
   void command(uint16_t number, const std::vector<int32_t>& words = {});
 
+  // The next kernel frame of a type, whole or its payload only (empty when none came).
+  std::vector<uint8_t> frame(uint16_t type, bool payload_only = false) {
+    std::optional<Frame> f = kernel->next_frame_of_type(type, std::chrono::seconds(5));
+    EXPECT_TRUE(f) << "no frame of type " << type;
+    return !f ? std::vector<uint8_t>{} : payload_only ? f->payload : f->raw;
+  }
   // Messages logged under KESTRELD since SetUp (or the last log->clear()).
   std::vector<std::string> lines() const { return log->messages(); }
 

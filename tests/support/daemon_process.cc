@@ -90,11 +90,7 @@ std::vector<LogRecord> DaemonProcess::records() const {
 }
 
 std::vector<std::string> DaemonProcess::messages(const std::string& tag) const {
-  std::vector<std::string> out;
-  for (const LogRecord& r : records()) {
-    if (r.tag == tag) out.push_back(r.message);
-  }
-  return out;
+  return messages_of(records(), tag);
 }
 
 bool DaemonProcess::wait_for(const std::string& message, std::chrono::milliseconds timeout,

@@ -52,12 +52,7 @@ std::vector<LogRecord> LogCapture::records() const {
 }
 
 std::vector<std::string> LogCapture::messages(const std::string& tag) const {
-  std::vector<std::string> out;
-  std::lock_guard<std::mutex> lock(g_mutex);
-  for (const LogRecord& r : *g_records) {
-    if (r.tag == tag) out.push_back(r.message);
-  }
-  return out;
+  return messages_of(records(), tag);
 }
 
 size_t LogCapture::count(const std::string& message, const std::string& tag) const {

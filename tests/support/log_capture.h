@@ -22,6 +22,16 @@ struct LogRecord {
   std::string letter() const { return {"??VDIWEF"[priority & 7], ' '}; }
 };
 
+// The messages of one tag among records, in order.
+inline std::vector<std::string> messages_of(const std::vector<LogRecord>& records,
+                                            const std::string& tag) {
+  std::vector<std::string> out;
+  for (const LogRecord& r : records) {
+    if (r.tag == tag) out.push_back(r.message);
+  }
+  return out;
+}
+
 // One at a time per process. Records of every thread are kept in order of logging.
 class LogCapture {
  public:

@@ -135,12 +135,6 @@ class RequestTest : public DaemonFixture {
     return r.value_or(Request{});
   }
 
-  // The next kernel frame of a type, as its whole raw bytes (empty when none came).
-  Bytes frame(uint16_t type) {
-    std::optional<Frame> f = kernel->next_frame_of_type(type, 2000ms);
-    return f ? f->raw : Bytes{};
-  }
-
   // True when no kernel frame at all arrives within a short quiet time.
   bool no_frame() { return kernel->drain(100ms).empty(); }
 };
