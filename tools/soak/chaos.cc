@@ -89,7 +89,7 @@ void usage(FILE* out) {
 }
 
 bool parse_options(int argc, char** argv, Options* o) {
-  for (int i = 1; i < argc; ++i) {
+  for (int i = 1; i < argc; i += 2) {
     const std::string a = argv[i];
     const char* v = i + 1 < argc ? argv[i + 1] : nullptr;
     if (v == nullptr && a != "--help") {
@@ -121,7 +121,6 @@ bool parse_options(int argc, char** argv, Options* o) {
       usage(stderr);
       return false;
     }
-    ++i;
   }
   return o->minutes >= 0 && o->time_scale > 0 && o->margin_ms >= 0;
 }
