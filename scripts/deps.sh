@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Makes sure the Debian packages a target needs are installed: installs them with apt-get when
 # run as root, and otherwise says exactly what to install.
-#   scripts/deps.sh base|fuzz|soak|arm64
+#   scripts/deps.sh base|fuzz|soak|arm64|vm-arm64
 set -euo pipefail
 
 # libpcap writes and reads kestrelctl's captures, gnuplot draws its plots; tshark (with
@@ -12,7 +12,7 @@ case "${1:-base}" in
   base) ;;
   fuzz) packages+=(clang libclang-rt-dev) ;;
   soak) packages+=(valgrind) ;;
-  arm64)
+  arm64|vm-arm64)
     # The cross compiler, qemu-user to run what it builds, bpfmt for Android.bp, and liblog and
     # GoogleTest for arm64 from Debian's multiarch, which needs arm64 as a foreign architecture
     # (added here as root; the install below then updates the package lists).
@@ -28,8 +28,14 @@ case "${1:-base}" in
              "sudo dpkg --add-architecture arm64 && sudo apt-get update" >&2
       fi
     fi
+    # The arm64 VM test: qemu-system-aarch64, and the build machine's kernel headers, whose common
+    # part and kbuild helpers build the module against the arm64 headers of the same version
+    # (scripts/vm/arm64.sh fetches the arm64 kernel, headers and busybox itself).
+    if [ "$1" = vm-arm64 ]; then
+      packages+=(qemu-system-arm "linux-headers-$(dpkg --print-architecture)")
+    fi
     ;;
-  *) echo "usage: $0 base|fuzz|soak|arm64" >&2; exit 2 ;;
+  *) echo "usage: $0 base|fuzz|soak|arm64|vm-arm64" >&2; exit 2 ;;
 esac
 
 if ! command -v dpkg-query >/dev/null 2>&1; then
