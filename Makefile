@@ -2,7 +2,7 @@
 # missing through apt-get when run as root, and say what to install otherwise.
 BUILD ?= build
 
-.PHONY: all build deps test demo fuzz clean arm64-test bench soak chaos
+.PHONY: all build deps test demo fuzz clean arm64-test vm-test vm-test-arm64 bench soak chaos
 
 all: build
 
@@ -30,6 +30,17 @@ fuzz:
 arm64-test:
 	@scripts/deps.sh arm64
 	@scripts/arm64_test.sh
+
+# The VM test: a real kernel at the other end of the daemon's netlink socket, x86-64 by default;
+# ARCH=arm64 runs the same checks on Debian's arm64 kernel under qemu-system-aarch64 with the arm64
+# build of the daemon and its tools (scripts/vm/arm64.sh; docs/device.md).
+ARCH ?= x86_64
+vm-test:
+	@scripts/deps.sh $(if $(filter arm64,$(ARCH)),vm-arm64,vm)
+	@ARCH=$(ARCH) scripts/vm_test.sh
+
+vm-test-arm64:
+	@$(MAKE) --no-print-directory vm-test ARCH=arm64
 
 # The benchmarks, built in Release in build-bench and run against their limits; rewrites
 # docs/performance.md with the figures (scripts/bench.sh).
