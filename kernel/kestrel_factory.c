@@ -4,8 +4,9 @@
  * command frames to the factory test daemon and takes every frame the daemon sends back.
  *
  * User space drives it through a misc character device, /dev/kestrel_factory:
- *   write()  one command frame (nlmsghdr and payload, nlmsg_len equal to the write's length),
- *            sent to the daemon's port id from port id 0;
+ *   write()  one command frame (nlmsghdr and payload; nlmsg_len is the write's length, or that
+ *            length less the alignment bytes after the payload), sent to the daemon's port id
+ *            from port id 0;
  *   read()   one whole datagram the daemon sent, in arrival order, for every file opened for
  *            reading (each such file has its own bounded queue);
  *   poll()   readable while that queue holds a datagram, always writable.
@@ -192,7 +193,8 @@ static ssize_t kf_send(const char __user *buf, size_t len, bool check)
 	}
 	if (check) {
 		memcpy(&hdr, skb->data, sizeof(hdr));
-		if (hdr.nlmsg_len != len) {
+		if (hdr.nlmsg_len < NLMSG_HDRLEN ||
+		    (hdr.nlmsg_len != len && NLMSG_ALIGN(hdr.nlmsg_len) != len)) {
 			atomic_long_inc(&kf_rejected);
 			kfree_skb(skb);
 			return -EINVAL;
