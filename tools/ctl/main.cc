@@ -84,13 +84,17 @@ in another terminal shows what the daemon answers):
 
 Captures:
   decode <file> [--csv FILE] [--plot FILE]
-                                  print the protocol 23 frames of a netlink capture (from
-                                  --pcap, or from tcpdump on a phone's nlmon interface), each
+                                  print the protocol 23 frames of a capture (from --pcap, or
+                                  from tcpdump on a phone's nlmon interface or on any), each
                                   with its time stamp (UTC) and direction, told by the sender's
                                   port id (20000 is the daemon); packets of other netlink
-                                  protocols are skipped and counted. A capture that ends inside
-                                  a packet, or holds a packet cut short, is exit status 4 after
-                                  the frames before it.
+                                  protocols or other link types are skipped and counted. A
+                                  capture that ends inside a packet, or holds a packet cut
+                                  short, is exit status 4 after the frames before it.
+  decode --live <interface> [--seconds N] [--pcap FILE] [--csv FILE] [--plot FILE]
+                                  the same, live from a netlink monitor interface (ip link add
+                                  nlmon0 type nlmon) or any, until N seconds or Ctrl-C; --pcap
+                                  keeps what it saw, with the interface's link type
 
 Sensors: accel 0, gyro 1, mag 2, pressure 3, light 4, light-short 5, or any sensor_type
 number (negative allowed; 0x hex too).
@@ -142,7 +146,7 @@ struct Options {
   std::optional<double> seconds;
   std::optional<long> count;
   std::optional<int32_t> flag;
-  std::optional<std::string> pcap, csv, plot;
+  std::optional<std::string> pcap, csv, plot, live;
   std::vector<std::string> args;
 };
 
@@ -236,6 +240,8 @@ Options parse_options(int argc, char** argv) {
       o.count = n;
     } else if (name == "--pcap") {
       o.pcap = take_value();
+    } else if (name == "--live") {
+      o.live = take_value();
     } else if (name == "--kernel-device") {
       KernelPort::use_device(take_value());
     } else if (name == "--csv") {
@@ -309,6 +315,7 @@ class Ctl {
   int hh();
   int listen();
   int decode();
+  int decode_packets(CaptureReader* reader, bool live);
   int write_samples(const StreamSamples& samples);
 
   Options o_;
@@ -536,21 +543,52 @@ std::string stamp(const struct timeval& time, bool json) {
 }
 
 int Ctl::decode() {
-  expect_arguments(1, "decode <capture file> [--csv FILE] [--plot FILE]");
   CaptureReader reader;
   std::string error;
-  if (!reader.open(o_.args[1], &error)) {
+  if (!o_.live) {
+    expect_arguments(1, "decode <capture file> [--csv FILE] [--plot FILE]");
+    if (!reader.open(o_.args[1], &error)) {
+      note(error);
+      return kExitFile;
+    }
+    if (!reader.carries_netlink()) {
+      note(o_.args[1] + ": link type " + reader.link_type_name() +
+           " carries no netlink (capture on an nlmon interface, or on any)");
+    }
+    return decode_packets(&reader, false);
+  }
+  expect_arguments(0, "decode --live <interface> [--seconds N] [--pcap FILE]");
+  if (!reader.open_live(*o_.live, &error) || (o_.pcap && !reader.keep(*o_.pcap, &error))) {
     note(error);
     return kExitFile;
   }
+  // SIGINT and SIGTERM come only while the reader waits, so none is missed before the wait.
+  sigset_t interrupts;
+  sigemptyset(&interrupts);
+  sigaddset(&interrupts, SIGINT);
+  sigaddset(&interrupts, SIGTERM);
+  sigprocmask(SIG_BLOCK, &interrupts, nullptr);
+  catch_interrupts();
+  note("listening on " + *o_.live + ", link type " + reader.link_type_name() +
+       (reader.carries_netlink() ? "" : " (no netlink: its packets are skipped and counted)"));
+  return decode_packets(&reader, true);
+}
+
+// Prints the protocol 23 frames of the packets, each with its time and direction, until the file
+// ends or, live, until --seconds have passed or an interrupt comes.
+int Ctl::decode_packets(CaptureReader* reader, bool live) {
+  std::optional<Clock::time_point> end;
+  if (live && o_.seconds) end = after_seconds(*o_.seconds);
   StreamSamples samples;
   uint64_t frames = 0;
   uint64_t foreign = 0;
   int status = kExitOk;
-  for (;;) {
+  while (!g_interrupted && (!end || Clock::now() < *end)) {
     CapturedPacket p;
-    const CaptureReader::Next next = reader.next(&p, &error);
-    if (next == CaptureReader::Next::kEnd) break;
+    std::string error;
+    const CaptureReader::Next next = reader->next(&p, &error, end ? milliseconds_until(*end) : -1);
+    if (next == CaptureReader::Next::kEnd && !live) break;
+    if (next == CaptureReader::Next::kEnd) continue;
     if (next == CaptureReader::Next::kError) {
       note(error);
       status = kExitFile;
@@ -730,9 +768,11 @@ int Ctl::dispatch() {
     only_options({"--seconds", "--csv"});
     return stream();
   }
+  if (o_.live && command != "decode") throw UsageError("--live applies to decode only");
   if (command == "decode") {
-    only_options({"--csv"});
-    if (o_.pcap) throw UsageError("--pcap does not apply to decode");
+    only_options({"--csv", "--seconds"});
+    if (o_.pcap && !o_.live) throw UsageError("--pcap applies to decode --live only");
+    if (o_.seconds && !o_.live) throw UsageError("--seconds applies to decode --live only");
     return decode();
   }
   if (command == "calib") {
