@@ -12,7 +12,7 @@
 set -euo pipefail
 
 cd "$(dirname "$0")/.."
-source scripts/arm64_build.sh
+toolchain=cmake/aarch64-linux-gnu.cmake
 jobs=2
 
 step() { printf '\n== %s\n' "$*"; }
@@ -30,8 +30,8 @@ fi
 start=$SECONDS
 step "arm64 build (build-arm64)"
 t=$SECONDS
-arm64_configure build-arm64 -DCMAKE_BUILD_TYPE=Release -DKESTREL_BUILD_BENCH=OFF \
-                -DKESTREL_BUILD_FUZZ=OFF
+cmake --no-warn-unused-cli -S . -B build-arm64 -G Ninja -DCMAKE_TOOLCHAIN_FILE=$toolchain \
+      -DCMAKE_BUILD_TYPE=Release -DKESTREL_BUILD_BENCH=OFF -DKESTREL_BUILD_FUZZ=OFF >/dev/null
 # Only the test binaries that run here (each test is named after its target), and the programs.
 targets=$(cd build-arm64 && ctest -N -LE 'spawns|device' | sed -n 's/^ *Test *#[0-9]*: //p')
 cmake --build build-arm64 --target kestreld $targets -- -j$jobs
@@ -87,7 +87,8 @@ for compiler in gcc clang; do
   fi
   step "device side compiled for arm64 with $compiler ($dir)"
   t=$SECONDS
-  arm64_configure $dir -DKESTREL_PLATFORM=device "${options[@]}"
+  cmake --no-warn-unused-cli -S . -B $dir -G Ninja -DCMAKE_TOOLCHAIN_FILE=$toolchain \
+        -DKESTREL_PLATFORM=device "${options[@]}" >/dev/null
   cmake --build $dir -- -j$jobs
   if [ $compiler = gcc ]; then check_phone_library_symbols $dir; fi
   elapsed $t

@@ -30,9 +30,10 @@ case "${1:-base}" in
     fi
     # The arm64 VM test: qemu-system-aarch64, and the build machine's kernel headers, whose common
     # part and kbuild helpers build the module against the arm64 headers of the same version
-    # (scripts/vm/arm64.sh fetches the arm64 kernel, headers and busybox itself).
+    # (scripts/vm/arm64.sh fetches the arm64 kernel, headers, busybox and bash itself; bash:arm64
+    # loads libtinfo6:arm64).
     if [ "$1" = vm-arm64 ]; then
-      packages+=(qemu-system-arm "linux-headers-$(dpkg --print-architecture)")
+      packages+=(qemu-system-arm "linux-headers-$(dpkg --print-architecture)" libtinfo6:arm64)
     fi
     ;;
   *) echo "usage: $0 base|fuzz|soak|arm64|vm-arm64" >&2; exit 2 ;;

@@ -32,7 +32,7 @@ finish() {
 }
 
 # The newest kernel whose image and headers are both installed.
-kroot=${KERNEL_ROOT:-}
+kroot=${KERNEL_ROOT:-$kernel_root}
 kver=$(for image in "$kroot"/boot/vmlinuz-*-"$kernel_suffix"; do
          v=${image##*/vmlinuz-}
          [ -d "$kroot/usr/src/linux-headers-$v" ] && echo "$v"
@@ -60,12 +60,18 @@ cmake -S . -B "$target_build" -G Ninja -DKESTREL_BUILD_BENCH=OFF "${cmake_args[@
 cmake --build "$target_build" --target kestreld kestrelctl kestrel-sim > /dev/null
 ctl=$target_build/tools/ctl/kestrelctl
 host_ctl=${HOST_KESTRELCTL:-$ctl}
+if [ -z "${HOST_KESTRELCTL:-}" ] && [ "$target_build" != "${BUILD:-build}" ]; then
+  # The captures are decoded outside the VM, by this machine's kestrelctl.
+  cmake -S . -B "${BUILD:-build}" -G Ninja -DKESTREL_BUILD_BENCH=OFF > /dev/null
+  cmake --build "${BUILD:-build}" --target kestrelctl > /dev/null
+  host_ctl=${BUILD:-build}/tools/ctl/kestrelctl
+fi
 
-# The initramfs: busybox, bash for the scripts, iproute2's ip (busybox's knows no nlmon), the
+# The initramfs: busybox, bash for the scripts, iproute2's ip where the target has it, the
 # programs in the build tree's layout, the two modules, and every library they load.
 root=$out/root
 mkdir -p "$root"/{bin,proc,sys,dev,tmp,results,lib/modules}
-cp "$(command -v busybox)" "$root/bin/busybox"
+cp "$busybox" "$root/bin/busybox"
 add() {  # program, path in the VM
   install -D -m 755 "$1" "$root$2"
   local lib
@@ -73,13 +79,20 @@ add() {  # program, path in the VM
     [ -e "$root$lib" ] || install -D -m 755 "$lib" "$root$lib"
   done
 }
-add "$(command -v bash)" /bin/bash
-add "$(command -v ip)" /usr/sbin/ip
+add "$bash" /bin/bash
+[ -z "$ip" ] || add "$ip" /usr/sbin/ip
+mkdir -p "$root/lib/modules/boot"
+n=0
+for module in ${boot_modules[@]+"${boot_modules[@]}"}; do
+  n=$((n + 1))
+  cp "$module" "$root/lib/modules/boot/$n-${module##*/}"
+done
+echo "$results_tty" > "$root/results-tty"
 for program in kestreld tools/ctl/kestrelctl tools/sim/kestrel-sim; do
   add "$target_build/$program" "/build/$program"
 done
 # Until kestrelctl captures live itself, dumpcap takes the nlmon capture.
-"$ctl" --help 2>&1 | grep -q -- '--live' || add "$(command -v dumpcap)" /usr/bin/dumpcap
+"$host_ctl" --help 2>&1 | grep -q -- '--live' || add "$(command -v dumpcap)" /usr/bin/dumpcap
 cp "$out/module/kestrel_factory.ko" "$root/lib/modules/"
 nlmon=$(find "$kroot/lib/modules/$kver" -name 'nlmon.ko*' | head -n 1)
 case "$nlmon" in
@@ -94,8 +107,8 @@ install -D -m 644 tools/sim/sample_registry.txt "$root/tools/sim/sample_registry
 (cd "$root" && find . | cpio -o -H newc --quiet) | gzip -1 > "$out/initramfs.gz"
 
 # KVM only when it boots the kernel to its panic (no root file system) within a few seconds.
-accel=(-accel tcg -cpu max)
-if [ "${VM_ACCEL:-}" != tcg ] && [ -w /dev/kvm ] &&
+accel=(-accel tcg -cpu "$tcg_cpu")
+if [ "${VM_ACCEL:-}" != tcg ] && [ -n "$kvm_cpu" ] && [ -w /dev/kvm ] &&
     timeout 10 "${qemu[@]}" -accel kvm -cpu "$kvm_cpu" -display none -nodefaults -no-reboot \
       -kernel "$kimage" -append "panic=-1 loglevel=0" < /dev/null > /dev/null 2>&1; then
   accel=(-accel kvm -cpu "$kvm_cpu")
@@ -103,7 +116,7 @@ fi
 echo "booting with ${accel[*]}"
 boot=$SECONDS
 timeout "${VM_TIMEOUT:-170}" "${qemu[@]}" "${accel[@]}" -display none -nodefaults -no-reboot \
-  -serial stdio -serial "file:$out/results.b64" -kernel "$kimage" -initrd "$out/initramfs.gz" \
+  -serial stdio $(results_args "$out/results.b64") -kernel "$kimage" -initrd "$out/initramfs.gz" \
   -append "console=$console panic=-1 loglevel=3 rdinit=/init" < /dev/null |
   tr -d '\r' | tee "$out/console.log" | grep -E '^(PASS|FAIL|boot|sent) ' || true
 sed -i '/passed, .* failed (in the VM)/d' "$out/console.log"
