@@ -34,7 +34,8 @@ constexpr command_entry kBigdata = {"NETLINK_MESSAGE_BIGDATA", kWithArgument,
                                     [](const uint8_t* f) { send_bigdata(f); }};
 
 constexpr command_entry kCommands[kLastCommand + 1] = {
-    /* 0 */ {"NETLINK_MESSAGE_GET_STATUS", kWithSensorType, [](const uint8_t* f) { get_status(f); }},
+    /* 0 */ {"NETLINK_MESSAGE_GET_STATUS", kWithSensorType,
+             [](const uint8_t* f) { get_status(f); }},
     /* 1 */
     {"NETLINK_MESSAGE_GET_RAW_DATA", kWithSensorType, [](const uint8_t* f) { get_raw_data(f); }},
     /* 2 */ kNone,
@@ -101,15 +102,6 @@ constexpr command_entry kCommands[kLastCommand + 1] = {
 };
 
 }  // namespace
-
-const char* command_name(uint32_t command) {
-  return command <= static_cast<uint32_t>(kLastCommand) ? kCommands[command].name : nullptr;
-}
-
-uint32_t command_min_frame_length(uint32_t command) {
-  return command <= static_cast<uint32_t>(kLastCommand) ? kCommands[command].min_frame_length
-                                                        : kFrameHeaderSize;
-}
 
 int process_message(const uint8_t* buffer, int32_t count) {
   // The netlink walk (NLMSG_OK / NLMSG_NEXT), with each header copied out of the buffer so its
