@@ -30,6 +30,8 @@ constexpr uint32_t kWithArgument = kArgumentOffset + 4;
 constexpr uint32_t kWithCoefficients = kCoefficientsOffset + 8 * 4;
 
 constexpr command_entry kNone = {nullptr, kFrameHeaderSize, nullptr};
+// Every command of the bulk-data family (is_bigdata_command) runs this one; their rows in
+// kCommands are empty.
 constexpr command_entry kBigdata = {"NETLINK_MESSAGE_BIGDATA", kWithArgument,
                                     [](const uint8_t* f) { send_bigdata(f); }};
 
@@ -80,17 +82,17 @@ constexpr command_entry kCommands[kLastCommand + 1] = {
     /* 19 */ {"NETLINK_MESSAGE_DUMP_REGISTER", kWithSensorType, &run_dump_register_command},
     /* 20 */ kNone,
     /* 21 */ kNone,
-    /* 22 */ kBigdata,
-    /* 23 */ kBigdata,
-    /* 24 */ kBigdata,
-    /* 25 */ kBigdata,
-    /* 26 */ kBigdata,
+    /* 22 */ kNone,
+    /* 23 */ kNone,
+    /* 24 */ kNone,
+    /* 25 */ kNone,
+    /* 26 */ kNone,
     /* 27 */ {"NETLINK_MESSAGE_DIAG_LOGGING", kWithArgument, &run_diag_logging_command},
-    /* 28 */ kBigdata,
-    /* 29 */ kBigdata,
+    /* 28 */ kNone,
+    /* 29 */ kNone,
     /* 30 */ kNone,
-    /* 31 */ kBigdata,
-    /* 32 */ kBigdata,
+    /* 31 */ kNone,
+    /* 32 */ kNone,
     /* 33 */ kNone,
     /* 34 */ kNone,
     /* 35 */
@@ -100,6 +102,13 @@ constexpr command_entry kCommands[kLastCommand + 1] = {
     {"NETLINK_MESSAGE_HH_FILE_PERMISSIONS", kFrameHeaderSize,
      [](const uint8_t*) { run_hh_file_permissions_command(); }},
 };
+
+// The entry of a command number, null when the number has no action.
+const command_entry* command_entry_of(uint16_t command) {
+  if (is_bigdata_command(command)) return &kBigdata;
+  if (command > kLastCommand || kCommands[command].run == nullptr) return nullptr;
+  return &kCommands[command];
+}
 
 }  // namespace
 
@@ -120,13 +129,12 @@ int process_message(const uint8_t* buffer, int32_t count) {
     }
     const uint16_t command = hdr.nlmsg_type;
     KLOGI("%s: %d", "process_message", command);
-    if (command <= kLastCommand && kCommands[command].run != nullptr) {
-      const command_entry& entry = kCommands[command];
-      if (hdr.nlmsg_len < entry.min_frame_length) {
-        KLOGE("%s: %s refused: frame of %u bytes, needs %u", "process_message", entry.name,
-              hdr.nlmsg_len, entry.min_frame_length);
+    if (const command_entry* entry = command_entry_of(command)) {
+      if (hdr.nlmsg_len < entry->min_frame_length) {
+        KLOGE("%s: %s refused: frame of %u bytes, needs %u", "process_message", entry->name,
+              hdr.nlmsg_len, entry->min_frame_length);
       } else {
-        entry.run(frame);
+        entry->run(frame);
       }
     }
     const uint32_t step = NLMSG_ALIGN(hdr.nlmsg_len);
