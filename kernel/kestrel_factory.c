@@ -10,7 +10,9 @@
  *   read()   one whole datagram the daemon sent, in arrival order, for every file opened for
  *            reading (each such file has its own bounded queue);
  *   poll()   readable while that queue holds a datagram, always writable.
- * Counters sit beside the device in sysfs; debugfs has an "inject" file whose every write goes
+ * Counters sit beside the device in sysfs (sent, received, malformed, rejected writes, and
+ * dropped: every datagram of the daemon that a reading file did not get, because none was open,
+ * its queue was full, or it was closed before reading it); debugfs has an "inject" file whose every write goes
  * to the daemon unchecked, for tests of the daemon's frame walk.
  *
  * The kernel filters netlink protocols it does not know from netlink monitors (nlmon), so the
@@ -293,6 +295,8 @@ static int kf_release(struct inode *inode, struct file *file)
 	spin_lock_bh(&kf_readers_lock);
 	list_del(&r->node);
 	spin_unlock_bh(&kf_readers_lock);
+	/* What the file never read is lost too. */
+	atomic_long_add(skb_queue_len(&r->queue), &kf_dropped);
 	skb_queue_purge(&r->queue);
 	kfree(r);
 	return 0;

@@ -4,7 +4,7 @@
 #      test that runs in-process run under qemu-user, each in its own network namespace. Left out:
 #      tests that start kestreld, kestrel-sim or kestrelctl as processes (label "spawns") and
 #      death tests, which run their own binary again: without binfmt_misc the kernel cannot exec
-#      an arm64 program. android/Android.bp is checked with bpfmt among these tests.
+#      an arm64 program. Android.bp is checked with bpfmt among these tests.
 #   2. the device side compiled for arm64 with the device platform file and the phone's header
 #      layout (KESTREL_PLATFORM=device), with g++ and with clang (build-arm64-device,
 #      build-arm64-device-clang), and the functions it takes from the phone's libraries.

@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Makes sure the Debian packages a target needs are installed: installs them with apt-get when
 # run as root, and otherwise says exactly what to install.
-#   scripts/deps.sh base|fuzz|soak|arm64|vm-arm64
+#   scripts/deps.sh base|fuzz|soak|arm64|vm
 set -euo pipefail
 
 # libpcap writes and reads kestrelctl's captures, gnuplot draws its plots; tshark (with
@@ -12,7 +12,7 @@ case "${1:-base}" in
   base) ;;
   fuzz) packages+=(clang libclang-rt-dev) ;;
   soak) packages+=(valgrind) ;;
-  arm64|vm-arm64)
+  arm64)
     # The cross compiler, qemu-user to run what it builds, bpfmt for Android.bp, and liblog and
     # GoogleTest for arm64 from Debian's multiarch, which needs arm64 as a foreign architecture
     # (added here as root; the install below then updates the package lists).
@@ -28,15 +28,24 @@ case "${1:-base}" in
              "sudo dpkg --add-architecture arm64 && sudo apt-get update" >&2
       fi
     fi
-    # The arm64 VM test: qemu-system-aarch64, and the build machine's kernel headers, whose common
-    # part and kbuild helpers build the module against the arm64 headers of the same version
-    # (scripts/vm/arm64.sh fetches the arm64 kernel, headers, busybox and bash itself; bash:arm64
-    # loads libtinfo6:arm64).
-    if [ "$1" = vm-arm64 ]; then
-      packages+=(qemu-system-arm "linux-headers-$(dpkg --print-architecture)" libtinfo6:arm64)
-    fi
     ;;
-  *) echo "usage: $0 base|fuzz|soak|arm64|vm-arm64" >&2; exit 2 ;;
+  vm)
+    # A kernel to boot with the headers to build the module against (the same version: the
+    # metapackages), the emulator, busybox for the VM's userland, sparse for the module's check
+    # and cpio for the initramfs. ARCH picks the kernel and emulator (scripts/vm/arch.sh).
+    case "${ARCH:-x86_64}" in
+      x86_64) packages+=(linux-image-amd64 linux-headers-amd64 qemu-system-x86) ;;
+      arm64)
+        # The arm64 cross build's packages (arm64 as a foreign architecture first), the emulator,
+        # and the build machine's kernel headers: their common part and kbuild helpers build the
+        # module against Debian's arm64 headers of the same version, which scripts/vm/arm64.sh
+        # fetches with the arm64 kernel, busybox and bash (bash:arm64 loads libtinfo6:arm64).
+        "$0" arm64
+        packages+=(qemu-system-arm "linux-headers-$(dpkg --print-architecture)" libtinfo6:arm64) ;;
+    esac
+    packages+=(busybox-static sparse cpio make)
+    ;;
+  *) echo "usage: $0 base|fuzz|soak|arm64|vm" >&2; exit 2 ;;
 esac
 
 if ! command -v dpkg-query >/dev/null 2>&1; then

@@ -36,7 +36,7 @@ arm64_kernel_version() {
   local kbuild
   kbuild=$(dpkg-query -W -f '${Package} ${Version} ${db:Status-Status}\n' 'linux-kbuild-*' \
              2> /dev/null | awk '$3 == "installed"' | sort -V | tail -n 1)
-  [ -n "$kbuild" ] || { echo "vm-test: no linux-kbuild installed: run scripts/deps.sh vm-arm64" >&2
+  [ -n "$kbuild" ] || { echo "vm-test: no linux-kbuild installed: run make vm-test-arm64" >&2
                         return 1; }
   kbuild_dir=/usr/lib/${kbuild%% *}
   kernel_version=$(awk '{print $2}' <<< "$kbuild")
@@ -45,7 +45,7 @@ arm64_kernel_version() {
                awk -v v="$kernel_version" '$2 == v && $3 == "installed" {print $1}' |
                sed 's/^linux-headers-//; s/-common$//' | sort -V | tail -n 1)
   [ -n "$kernel_abi" ] || { echo "vm-test: no linux-headers-*-common $kernel_version installed:" \
-                                 "run scripts/deps.sh vm-arm64" >&2; return 1; }
+                                 "run make vm-test-arm64" >&2; return 1; }
 }
 
 # Fetches and unpacks the kernel image and the modules the VM loads (of the image package's 350 MB
