@@ -91,8 +91,6 @@ echo "$results_tty" > "$root/results-tty"
 for program in kestreld tools/ctl/kestrelctl tools/sim/kestrel-sim; do
   add "$target_build/$program" "/build/$program"
 done
-# Until kestrelctl captures live itself, dumpcap takes the nlmon capture.
-"$host_ctl" --help 2>&1 | grep -q -- '--live' || add "$(command -v dumpcap)" /usr/bin/dumpcap
 cp "$out/module/kestrel_factory.ko" "$root/lib/modules/"
 nlmon=$(find "$kroot/lib/modules/$kver" -name 'nlmon.ko*' | head -n 1)
 case "$nlmon" in

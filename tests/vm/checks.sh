@@ -50,9 +50,8 @@ refused() {  # a bad write: kestrelctl fails and the module counts it as rejecte
   local before; before=$(counter rejected)
   ! ctl raw "$@" && [ "$(counter rejected)" -eq $((before + 1)) ]
 }
-capture() {  # interface, file: dumpcap where the VM has it, else kestrelctl's live decoder
-  if command -v dumpcap > /dev/null; then exec dumpcap -q -P -i "$1" -w "$2"
-  else exec $build/tools/ctl/kestrelctl decode --live "$1" --pcap "$2" > /dev/null; fi
+capture() {  # interface, file
+  exec $build/tools/ctl/kestrelctl decode --live "$1" --pcap "$2" > /dev/null
 }
 nlmon_up() {
   insmod /lib/modules/nlmon.ko && ip link add nlmon0 type nlmon && ip link set nlmon0 up || return 1
