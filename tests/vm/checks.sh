@@ -31,11 +31,13 @@ inject() { timeout 20 $build/tools/ctl/kestrelctl --kernel-device "$inject" --pc
 wait_log() {  # text, seconds
   timeout "$2" sh -c 'until grep -qF -- "$0" "$1"; do sleep 0.1; done' "$1" "$log"
 }
-start_daemon() {
+start_daemon() {  # and waits for the one frame it sends unasked, so counters read later hold it
+  local before; before=$(counter received)
   : > "$log"
   $build/kestreld 2> "$log" &
   daemon=$!
-  wait_log "main: do while start = 0" 20
+  wait_log "main: do while start = 0" 20 &&
+    timeout 10 sh -c 'until [ "$(cat "$0")" -gt "$1" ]; do sleep 0.1; done' "$sys/received" "$before"
 }
 answers() {  # log text, command...: the command succeeds and the daemon logs the text
   local text=$1; shift
