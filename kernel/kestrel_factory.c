@@ -4,12 +4,15 @@
  * command frames to the factory test daemon and takes every frame the daemon sends back.
  *
  * User space drives it through a misc character device, /dev/kestrel_factory:
- *   write()  one command frame (nlmsghdr and payload, nlmsg_len equal to the write's length),
- *            sent to the daemon's port id from port id 0;
+ *   write()  one command frame (nlmsghdr and payload; nlmsg_len is the write's length, or that
+ *            length less the alignment bytes after the payload), sent to the daemon's port id
+ *            from port id 0;
  *   read()   one whole datagram the daemon sent, in arrival order, for every file opened for
  *            reading (each such file has its own bounded queue);
  *   poll()   readable while that queue holds a datagram, always writable.
- * Counters sit beside the device in sysfs; debugfs has an "inject" file whose every write goes
+ * Counters sit beside the device in sysfs (sent, received, malformed, rejected writes, and
+ * dropped: every datagram of the daemon that a reading file did not get, because none was open,
+ * its queue was full, or it was closed before reading it); debugfs has an "inject" file whose every write goes
  * to the daemon unchecked, for tests of the daemon's frame walk.
  *
  * The kernel filters netlink protocols it does not know from netlink monitors (nlmon), so the
@@ -192,7 +195,8 @@ static ssize_t kf_send(const char __user *buf, size_t len, bool check)
 	}
 	if (check) {
 		memcpy(&hdr, skb->data, sizeof(hdr));
-		if (hdr.nlmsg_len != len) {
+		if (hdr.nlmsg_len < NLMSG_HDRLEN ||
+		    (hdr.nlmsg_len != len && NLMSG_ALIGN(hdr.nlmsg_len) != len)) {
 			atomic_long_inc(&kf_rejected);
 			kfree_skb(skb);
 			return -EINVAL;
@@ -291,6 +295,8 @@ static int kf_release(struct inode *inode, struct file *file)
 	spin_lock_bh(&kf_readers_lock);
 	list_del(&r->node);
 	spin_unlock_bh(&kf_readers_lock);
+	/* What the file never read is lost too. */
+	atomic_long_add(skb_queue_len(&r->queue), &kf_dropped);
 	skb_queue_purge(&r->queue);
 	kfree(r);
 	return 0;
