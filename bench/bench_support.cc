@@ -152,15 +152,6 @@ void FrameDrain::run() {
   }
 }
 
-bool wait_until(const std::function<bool()>& cond, std::chrono::milliseconds timeout) {
-  const int64_t deadline = now_ns() + static_cast<int64_t>(timeout.count()) * 1000000;
-  for (;;) {
-    if (cond()) return true;
-    if (now_ns() > deadline) return false;
-    usleep(2000);
-  }
-}
-
 double median(std::vector<double> values) {
   if (values.empty()) return std::nan("");
   std::sort(values.begin(), values.end());

@@ -32,6 +32,7 @@ namespace kestrel_bench {
 
 using kestrel_driver::kDaemonPort;
 using kestrel_driver::kKernelPort;
+using kestrel_driver::wait_until;
 
 // Re-executes the program under `unshare -rn` (`unshare -n` where user namespaces are not
 // available) unless it already runs in the namespace it made. Netlink port ids and the daemon's
@@ -83,9 +84,6 @@ class FrameDrain {
   std::atomic<int64_t> last_ns_{0};
   std::thread thread_;
 };
-
-// Polls cond every few milliseconds until it holds. False on timeout.
-bool wait_until(const std::function<bool()>& cond, std::chrono::milliseconds timeout);
 
 // Every run that the library reported, by benchmark name (repetitions together).
 struct RunRecord {

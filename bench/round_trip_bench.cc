@@ -99,23 +99,20 @@ void start_relays(Setup& s) {
   }
 }
 
-// The daemon under measurement, ready once it has connected to the phone and its refresh thread
-// has sent its frame; then only its lasting threads (main and the sensor1 library's) are left.
+// The daemon under measurement, ready once it has connected to the phone and only its lasting
+// threads (main and the sensor1 library's) are left: its refresh thread has sent its frame.
 void start_daemon(Setup& s) {
   const int opened = s.phone->opened_connections();
   s.daemon = std::make_unique<ChildProcess>(
       std::vector<std::string>{kestrel_bench::kestreld_binary()},
       kestrel_driver::daemon_environment(s.dir, s.phone->socket_path(), kTimeScale));
   std::vector<uint8_t> frame;
-  if (!kestrel_bench::wait_until([&] { return s.phone->opened_connections() > opened; },
-                                 std::chrono::seconds(30))) {
-    s.error = "kestreld did not connect to the simulator";
-  } else if (!s.kernel->receive_type(FRAME_HH_REFRESH, std::chrono::seconds(30), &frame)) {
+  if (!kestrel_driver::wait_up(
+          s.daemon.get(), [&] { return s.phone->opened_connections() > opened; }, 2,
+          std::chrono::seconds(30))) {
+    s.error = "kestreld did not come up";
+  } else if (!s.kernel->receive_type(FRAME_HH_REFRESH, std::chrono::seconds(5), &frame)) {
     s.error = "kestreld's refresh frame did not come";
-  } else {
-    const pid_t pid = s.daemon->pid();
-    kestrel_bench::wait_until([&] { return kestrel_driver::process_thread_count(pid) <= 2; },
-                              std::chrono::seconds(20));
   }
 }
 

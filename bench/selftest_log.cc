@@ -49,14 +49,14 @@ SelftestLog record_selftest_log(const kestrel_driver::RunDir& dir, kestrel_sim::
       {kestreld_binary()},
       kestrel_driver::daemon_environment(dir, phone->socket_path(), time_scale), log.path());
   std::vector<uint8_t> frame;
-  if (!wait_until([&] { return phone->opened_connections() > opened; }, std::chrono::seconds(30)) ||
-      !kernel->receive_type(FRAME_HH_REFRESH, std::chrono::seconds(30), &frame)) {
+  if (!kestrel_driver::wait_up(
+          &daemon, [&] { return phone->opened_connections() > opened; }, 2,
+          std::chrono::seconds(30)) ||
+      !kernel->receive_type(FRAME_HH_REFRESH, std::chrono::seconds(5), &frame)) {
     out.error = "kestreld did not come up for the log count";
     return out;
   }
   out.main_thread = daemon.pid();
-  wait_until([&] { return kestrel_driver::process_thread_count(daemon.pid()) <= 2; },
-             std::chrono::seconds(20));
   const std::vector<uint8_t> command = kestrelctl::build_command(NETLINK_MESSAGE_SELFTEST, {0});
   auto self_test = [&] {
     return kernel->send(command) &&

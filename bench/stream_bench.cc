@@ -124,16 +124,14 @@ Setup& setup() {
   s.relay.process = std::make_unique<ChildProcess>(
       std::vector<std::string>{kestrel_bench::self_binary(), "--relay=" + relay_socket},
       kestrel_driver::current_environment());
-  if (!s.daemon.sim->wait_for_connection(std::chrono::seconds(30)) ||
+  // Up: connected, its start-up threads ended (within a second at this time scale), only its
+  // main thread and the sensor1 library's thread left.
+  if (!kestrel_driver::wait_up(
+          s.daemon.process.get(), [&] { return s.daemon.sim->current_connection() != 0; }, 2,
+          std::chrono::seconds(30)) ||
       !s.relay.sim->wait_for_connection(std::chrono::seconds(30))) {
     s.error = "kestreld or the relay did not connect to its simulator";
-    return s;
   }
-  // The daemon's start-up threads end within a second at this time scale; only its main thread
-  // and the sensor1 library's thread stay.
-  const pid_t pid = s.daemon.process->pid();
-  kestrel_bench::wait_until([&] { return kestrel_driver::process_thread_count(pid) <= 2; },
-                            std::chrono::seconds(20));
   return s;
 }
 

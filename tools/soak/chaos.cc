@@ -15,7 +15,6 @@
 //     for it at the start.
 // A failing run prints its seed and the command that replays it.
 #include <linux/netlink.h>
-#include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -40,6 +39,8 @@
 #include "tools/soak/command_cycle.h"
 #include "tools/soak/daemon_driver.h"
 #include "tools/soak/proc_readings.h"
+#include "tools/soak/tool_main.h"
+#include "tools/soak/verdicts.h"
 
 #ifndef KESTRELD_BINARY
 #error "KESTRELD_BINARY names the daemon"
@@ -77,54 +78,32 @@ struct Options {
   std::string replay;
 };
 
-void usage(FILE* out) {
-  fprintf(
-      out,
-      "usage: kestrel-chaos [options]   (run it in a network namespace of its own)\n"
-      "  --minutes X         length of the chaos (default 5)\n"
-      "  --seed N            seed of the schedule (default 1)\n"
-      "  --time-scale X      KESTREL_TIME_SCALE of the daemon (default 0.05)\n"
-      "  --margin-ms N       time beyond the scaled 8 s wait a command may take (default 1000)\n"
-      "  --registry FILE     sensors registry (the probe's answer comes from it)\n"
-      "  --daemon PATH       the daemon (default: the one built beside this program)\n"
-      "  --replay TEXT       the command that replays this run, printed when it fails\n");
-}
-
 bool parse_options(int argc, char** argv, Options* o) {
-  for (int i = 1; i < argc; i += 2) {
-    const std::string a = argv[i];
-    const char* v = i + 1 < argc ? argv[i + 1] : nullptr;
-    if (v == nullptr && a != "--help") {
-      usage(stderr);
-      return false;
-    }
-    if (a == "--minutes") {
-      o->minutes = atof(v);
-    } else if (a == "--seed") {
-      o->seed = strtoull(v, nullptr, 10);
-    } else if (a == "--time-scale") {
-      o->time_scale = atof(v);
-    } else if (a == "--margin-ms") {
-      o->margin_ms = atol(v);
-    } else if (a == "--idle-threads") {
-      o->idle_threads = atoi(v);
-    } else if (a == "--memory-slack-kb") {
-      o->memory_slack_kb = atol(v);
-    } else if (a == "--registry") {
-      o->registry = v;
-    } else if (a == "--daemon") {
-      o->daemon = v;
-    } else if (a == "--replay") {
-      o->replay = v;
-    } else if (a == "--help") {
-      usage(stdout);
-      exit(0);
-    } else {
-      usage(stderr);
-      return false;
-    }
-  }
-  return o->minutes >= 0 && o->time_scale > 0 && o->margin_ms >= 0;
+  const std::vector<ToolOption> options = {
+      {"--minutes", "X", "length of the chaos (default 5)",
+       [o](const char* v) { o->minutes = atof(v); }},
+      {"--seed", "N", "seed of the schedule (default 1)",
+       [o](const char* v) { o->seed = strtoull(v, nullptr, 10); }},
+      {"--time-scale", "X", "KESTREL_TIME_SCALE of the daemon (default 0.05)",
+       [o](const char* v) { o->time_scale = atof(v); }},
+      {"--margin-ms", "N", "time beyond the scaled 8 s wait a command may take (default 1000)",
+       [o](const char* v) { o->margin_ms = atol(v); }},
+      {"--idle-threads", "N", "threads of an idle daemon (default 2)",
+       [o](const char* v) { o->idle_threads = atoi(v); }},
+      {"--memory-slack-kb", "N", "private memory a daemon may gain (default 64; -1: any)",
+       [o](const char* v) { o->memory_slack_kb = atol(v); }},
+      {"--registry", "FILE", "sensors registry (the probe's answer comes from it)",
+       [o](const char* v) { o->registry = v; }},
+      {"--daemon", "PATH", "the daemon (default: the one built beside this program)",
+       [o](const char* v) { o->daemon = v; }},
+      {"--replay", "TEXT", "the command that replays this run, printed when it fails",
+       [o](const char* v) { o->replay = v; }},
+  };
+  return parse_tool_options(
+             argc, argv,
+             "usage: kestrel-chaos [options]   (run it in a network namespace of its own)",
+             options) &&
+         o->minutes >= 0 && o->time_scale > 0 && o->margin_ms >= 0;
 }
 
 class Chaos {
@@ -151,7 +130,7 @@ class Chaos {
   bool checkpoint(const char* when);
   bool healthy_session(std::vector<std::vector<uint8_t>>* frames);
   bool specified_exit();
-  bool check(bool ok, const std::string& what);
+  bool check(bool ok, const std::string& what) { return verdicts_.check(ok, what); }
   void fail(const std::string& what);
 
   const Options& o_;
@@ -183,23 +162,13 @@ class Chaos {
   Millis bound_{0};
   pid_t baseline_pid_ = -1;
   ProcessStatus baseline_, last_;
-  bool ok_ = true;
+  Verdicts verdicts_{"chaos", 66};
 };
 
-bool Chaos::check(bool ok, const std::string& what) {
-  printf("chaos: %-66s %s\n", what.c_str(), ok ? "ok" : "MISS");
-  if (!ok) ok_ = false;
-  return ok;
-}
-
 void Chaos::fail(const std::string& what) {
-  ok_ = false;
+  verdicts_.miss();
   fprintf(stderr, "chaos: FAILED: %s\n", what.c_str());
-  log_.update();
-  fprintf(stderr, "chaos: the daemon's last log lines:\n");
-  for (const std::string& l : log_.last()) {
-    if (!l.empty()) fprintf(stderr, "  %s\n", l.c_str());
-  }
+  log_.print_last("chaos");
   fprintf(stderr, "chaos: seed %llu; replay with: %s\n", static_cast<unsigned long long>(o_.seed),
           o_.replay.empty() ? "(not given)" : o_.replay.c_str());
 }
@@ -240,14 +209,11 @@ bool Chaos::start_daemon_and_wait() {
       std::vector<std::string>{o_.daemon},
       daemon_environment(dir_, sim_->socket_path(), o_.time_scale, o_.registry), log_.path());
   // Up: the start-up thread has opened the service and both start-up threads have ended.
-  const auto ready_by = Clock::now() + 60s;
-  while (!(sim_->opened_connections() > opened &&
-           process_status(daemon_->pid()).threads == o_.idle_threads)) {
-    if (daemon_ended() || Clock::now() >= ready_by) {
-      fail("the daemon did not come up");
-      return false;
-    }
-    std::this_thread::sleep_for(10ms);
+  if (!wait_up(
+          daemon_.get(), [&] { return sim_->opened_connections() > opened; }, o_.idle_threads,
+          60s)) {
+    fail("the daemon did not come up");
+    return false;
   }
   return true;
 }
@@ -399,7 +365,7 @@ bool Chaos::one_command(std::mt19937_64* rng) {
     if (p.reply >= 0) ++waiting_commands_;
     if (ms > slowest_ms_) std::tie(slowest_ms_, slowest_command_) = std::pair(ms, command);
   } else if (!specified_exit()) {
-    if (ok_) fail("command " + std::to_string(command) + " not done within its wait");
+    if (verdicts_.ok()) fail("command " + std::to_string(command) + " not done within its wait");
     return false;
   } else {
     phone_->enable(true);
@@ -422,16 +388,16 @@ void Chaos::chaos(std::vector<std::vector<uint8_t>>* reference,
       std::chrono::duration_cast<Clock::duration>((end - started) / 10), 10s);
   auto next_checkpoint = started + every;
   phone_->enable(true);
-  while (ok_ && Clock::now() < end) {
+  while (verdicts_.ok() && Clock::now() < end) {
     if (Clock::now() >= next_checkpoint) {
-      if (!checkpoint("chaos") && !ok_) break;
+      if (!checkpoint("chaos") && !verdicts_.ok()) break;
       phone_->enable(true);
       next_checkpoint = Clock::now() + every;
     }
     if (!one_command(&rng)) break;
   }
   phone_->enable(false);
-  const bool final_ok = ok_ && checkpoint("end") && healthy_session(final_frames);
+  const bool final_ok = verdicts_.ok() && checkpoint("end") && healthy_session(final_frames);
   if (!reference_ok || !final_ok) final_frames->clear();
 }
 
@@ -464,7 +430,7 @@ void Chaos::print_figures() {
   printf("chaos: last checkpoint:          rss %ld kB (anon %ld), %ld fds, %ld threads\n",
          last_.rss_kib, last_.rss_anon_kib, last_.descriptors, last_.threads);
   if (overruns_ > 0) printf("chaos: the kernel port's queue overflowed %ld times\n", overruns_);
-  check(ok_, "the daemon ended only with the close's result, and settled each time");
+  check(verdicts_.ok(), "the daemon ended only with the close's result, and settled each time");
   check(faults > 0 && commands_ > 0 && slowest_ms_ <= static_cast<double>(bound_.count()),
         "every command done within the scaled wait and the margin");
 }
@@ -493,21 +459,17 @@ int Chaos::run() {
   end();
   print_figures();
   check_sessions(reference, final_frames);
-  printf("chaos: %s\n", ok_ ? "PASS" : "FAIL");
-  if (!ok_) {
+  const int status = verdicts_.finish();
+  if (status != 0) {
     fprintf(stderr, "chaos: seed %llu; replay with: %s\n", static_cast<unsigned long long>(o_.seed),
             o_.replay.empty() ? "(not given)" : o_.replay.c_str());
     dir_.keep();
   }
-  return ok_ ? 0 : 1;
+  return status;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  Options o;
-  if (!parse_options(argc, argv, &o)) return 2;
-  signal(SIGPIPE, SIG_IGN);
-  setvbuf(stdout, nullptr, _IOLBF, 0);
-  return Chaos(o).run();
+  return kestrel_driver::tool_main<Chaos>(argc, argv, parse_options);
 }

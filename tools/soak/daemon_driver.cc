@@ -15,6 +15,8 @@
 #include <sstream>
 #include <thread>
 
+#include "tools/soak/proc_readings.h"
+
 extern char** environ;
 
 namespace kestrel_driver {
@@ -143,6 +145,27 @@ void ChildProcess::kill_and_reap() {
   wait_exit(std::chrono::hours(1));
 }
 
+bool wait_until(const std::function<bool()>& cond, std::chrono::milliseconds timeout) {
+  const auto deadline = Clock::now() + timeout;
+  for (;;) {
+    if (cond()) return true;
+    if (Clock::now() > deadline) return false;
+    std::this_thread::sleep_for(2ms);
+  }
+}
+
+bool wait_up(ChildProcess* daemon, const std::function<bool()>& connected, long idle_threads,
+             std::chrono::milliseconds timeout) {
+  bool ended = false;
+  wait_until(
+      [&] {
+        ended = daemon->wait_exit(0ms);
+        return ended || (connected() && process_thread_count(daemon->pid()) == idle_threads);
+      },
+      timeout);
+  return !ended && connected() && process_thread_count(daemon->pid()) == idle_threads;
+}
+
 bool parse_log_record(const std::string& line, LogRecord* record) {
   std::istringstream in(line);
   std::string tag, prio, date, time, pid, tid;
@@ -196,6 +219,14 @@ void DaemonLog::update(std::vector<LogRecord>* records) {
 long DaemonLog::seen(const std::string& pattern) const {
   const auto it = seen_.find(pattern);
   return it == seen_.end() ? 0 : it->second;
+}
+
+void DaemonLog::print_last(const char* prefix) {
+  update();
+  fprintf(stderr, "%s: the daemon's last log lines:\n", prefix);
+  for (const std::string& line : last_) {
+    if (!line.empty()) fprintf(stderr, "  %s\n", line.c_str());
+  }
 }
 
 bool DaemonLog::recent(const std::string& text) const {

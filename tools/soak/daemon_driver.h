@@ -9,6 +9,7 @@
 
 #include <chrono>
 #include <deque>
+#include <functional>
 #include <map>
 #include <mutex>
 #include <string>
@@ -74,6 +75,15 @@ class ChildProcess {
   int status_ = 0;
 };
 
+// Polls cond every few milliseconds until it holds. False on timeout.
+bool wait_until(const std::function<bool()>& cond, std::chrono::milliseconds timeout);
+
+// Waits for a daemon to come up: connected() holds and only its lasting threads are left
+// (idle_threads: main and the sensor1 library's), the start-up threads ended. False when it ended
+// first or the time ran out.
+bool wait_up(ChildProcess* daemon, const std::function<bool()>& connected, long idle_threads,
+             std::chrono::milliseconds timeout);
+
 // One record of the daemon's log: "<tag> <P> <MM-DD> <HH:MM:SS> <pid> <tid> <message>", the
 // message going on over the lines that do not start a record.
 struct LogRecord {
@@ -106,6 +116,8 @@ class DaemonLog {
   const std::deque<std::string>& last() const { return last_; }
   // True when one of the latest lines holds text.
   bool recent(const std::string& text) const;
+  // The latest lines on stderr, each after prefix, for a failure report.
+  void print_last(const char* prefix);
 
  private:
   std::string path_;

@@ -12,7 +12,6 @@
 // exit with the close's result, which valgrind --error-exitcode=1 replaces by 1 when it found
 // errors. The figures go to stdout; the exit status is 0 when every check held.
 #include <ctype.h>
-#include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
 
@@ -36,6 +35,8 @@
 #include "tools/soak/command_cycle.h"
 #include "tools/soak/daemon_driver.h"
 #include "tools/soak/proc_readings.h"
+#include "tools/soak/tool_main.h"
+#include "tools/soak/verdicts.h"
 
 #ifndef KESTRELD_BINARY
 #error "KESTRELD_BINARY names the daemon to soak"
@@ -82,53 +83,30 @@ struct Options {
   std::string valgrind_log;
 };
 
-void usage(FILE* out) {
-  fprintf(out,
-          "usage: kestrel-soak [options]   (run it in a network namespace of its own)\n"
-          "  --indications N     sample indications to feed (default 1000000)\n"
-          "  --commands N        kernel commands to send (default 100000)\n"
-          "  --time-scale X      KESTREL_TIME_SCALE of the daemon (default 0.05)\n"
-          "  --registry FILE     sensors registry for command 4 (default: none)\n"
-          "  --daemon PATH       the daemon (default: the one built beside this program)\n"
-          "  --valgrind          run the daemon under valgrind memcheck\n"
-          "  --suppressions FILE valgrind suppressions\n"
-          "  --valgrind-log FILE where valgrind writes (default: a temporary file)\n");
-}
-
 bool parse_options(int argc, char** argv, Options* o) {
-  for (int i = 1; i < argc; ++i) {
-    const std::string a = argv[i];
-    auto value = [&](const char** out) {
-      if (i + 1 >= argc) return false;
-      *out = argv[++i];
-      return true;
-    };
-    const char* v = nullptr;
-    if (a == "--indications" && value(&v)) {
-      o->indications = atol(v);
-    } else if (a == "--commands" && value(&v)) {
-      o->commands = atol(v);
-    } else if (a == "--time-scale" && value(&v)) {
-      o->time_scale = atof(v);
-    } else if (a == "--registry" && value(&v)) {
-      o->registry = v;
-    } else if (a == "--daemon" && value(&v)) {
-      o->daemon = v;
-    } else if (a == "--valgrind") {
-      o->valgrind = true;
-    } else if (a == "--suppressions" && value(&v)) {
-      o->suppressions = v;
-    } else if (a == "--valgrind-log" && value(&v)) {
-      o->valgrind_log = v;
-    } else if (a == "--help") {
-      usage(stdout);
-      exit(0);
-    } else {
-      usage(stderr);
-      return false;
-    }
-  }
-  return o->indications >= 0 && o->commands >= 10 && o->time_scale > 0;
+  const std::vector<ToolOption> options = {
+      {"--indications", "N", "sample indications to feed (default 1000000)",
+       [o](const char* v) { o->indications = atol(v); }},
+      {"--commands", "N", "kernel commands to send (default 100000)",
+       [o](const char* v) { o->commands = atol(v); }},
+      {"--time-scale", "X", "KESTREL_TIME_SCALE of the daemon (default 0.05)",
+       [o](const char* v) { o->time_scale = atof(v); }},
+      {"--registry", "FILE", "sensors registry for command 4 (default: none)",
+       [o](const char* v) { o->registry = v; }},
+      {"--daemon", "PATH", "the daemon (default: the one built beside this program)",
+       [o](const char* v) { o->daemon = v; }},
+      {"--valgrind", nullptr, "run the daemon under valgrind memcheck",
+       [o](const char*) { o->valgrind = true; }},
+      {"--suppressions", "FILE", "valgrind suppressions",
+       [o](const char* v) { o->suppressions = v; }},
+      {"--valgrind-log", "FILE", "where valgrind writes (default: a temporary file)",
+       [o](const char* v) { o->valgrind_log = v; }},
+  };
+  return parse_tool_options(
+             argc, argv,
+             "usage: kestrel-soak [options]   (run it in a network namespace of its own)",
+             options) &&
+         o->indications >= 0 && o->commands >= 10 && o->time_scale > 0;
 }
 
 // The commands one after the other, cycle after cycle.
@@ -302,7 +280,7 @@ class Soak {
   bool wait_quiet(std::chrono::seconds timeout);
   bool daemon_ended() { return daemon_->wait_exit(0ms); }
   void report_failure(const std::string& what);
-  bool check(bool ok, const std::string& what);
+  bool check(bool ok, const std::string& what) { return verdicts_.check(ok, what); }
   void print_figures(const Figures& f);
   void check_figures(const Figures& f);
 
@@ -320,21 +298,13 @@ class Soak {
   std::atomic<long> injected_sent_{0};
   std::atomic<long> inject_failures_{0};
   std::atomic<long> send_failures_{0};
-  bool ok_ = true;
+  Verdicts verdicts_{"soak", 62};
 };
-
-bool Soak::check(bool ok, const std::string& what) {
-  printf("soak: %-62s %s\n", what.c_str(), ok ? "ok" : "MISS");
-  if (!ok) ok_ = false;
-  return ok;
-}
 
 void Soak::report_failure(const std::string& what) {
   fprintf(stderr, "soak: %s\n", what.c_str());
-  log_.update();
-  fprintf(stderr, "soak: the daemon's last log lines:\n");
-  for (const std::string& l : log_.last()) fprintf(stderr, "  %s\n", l.c_str());
-  ok_ = false;
+  log_.print_last("soak");
+  verdicts_.miss();
 }
 
 void Soak::receive_frames() {
@@ -416,14 +386,12 @@ bool Soak::start() {
   printf("soak: %s%s, %ld sample indications, %ld commands of %d kinds, time scale %g\n",
          o_.valgrind ? "valgrind memcheck on " : "", o_.daemon.c_str(), o_.indications, o_.commands,
          kCommandKinds, o_.time_scale);
-  // Ready: the start-up thread has opened the service and both start-up threads have ended.
-  const auto ready_by = Clock::now() + (o_.valgrind ? 120s : 30s);
-  while (!(sim_->current_connection() != 0 && process_status(daemon_->pid()).threads == 2)) {
-    if (daemon_ended() || Clock::now() >= ready_by) {
-      report_failure("the daemon did not come up");
-      return false;
-    }
-    std::this_thread::sleep_for(20ms);
+  // Up: the start-up thread has opened the service and both start-up threads have ended.
+  if (!wait_up(
+          daemon_.get(), [&] { return sim_->current_connection() != 0; }, 2,
+          o_.valgrind ? 120s : 30s)) {
+    report_failure("the daemon did not come up");
+    return false;
   }
   return true;
 }
@@ -536,7 +504,7 @@ int Soak::run() {
   Figures f;
   if (!start()) {
     stop_receiving();
-    return ok_ ? 2 : 1;
+    return verdicts_.ok() ? 2 : 1;
   }
   work(&f);
   f.status = end_through_exit_path();
@@ -544,19 +512,15 @@ int Soak::run() {
   log_.update();
   print_figures(f);
   check_figures(f);
-  printf("soak: %s\n", ok_ ? "PASS" : "FAIL");
-  if (!ok_) report_failure("the soak missed");
+  const int status = verdicts_.finish();
+  if (status != 0) report_failure("the soak missed");
   // A failed run leaves its files for a look; so does one whose valgrind log is among them.
-  if (!ok_ || o_.valgrind_log.rfind(dir_.path(), 0) == 0) dir_.keep();
-  return ok_ ? 0 : 1;
+  if (status != 0 || o_.valgrind_log.rfind(dir_.path(), 0) == 0) dir_.keep();
+  return status;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  Options o;
-  if (!parse_options(argc, argv, &o)) return 2;
-  signal(SIGPIPE, SIG_IGN);
-  setvbuf(stdout, nullptr, _IOLBF, 0);
-  return Soak(o).run();
+  return kestrel_driver::tool_main<Soak>(argc, argv, parse_options);
 }
