@@ -51,7 +51,7 @@ TEST_F(CallbackThreadsTest, DroppedLinkIsReopenedAndLoggingRestartedAsTheDebugLe
   for (const bool level_stops : {false, true}) {
     write_file(test_properties_path(),
                level_stops ? "ro.debug_level=0x4f4c" : "ro.debug_level=0x494d");
-    set_diag_logging_state(1);
+    set_diag_logging_state(diag_state::logging);
     log->clear();
     sim->drop_connection();
 
@@ -66,7 +66,7 @@ TEST_F(CallbackThreadsTest, DroppedLinkIsReopenedAndLoggingRestartedAsTheDebugLe
     expected.insert(expected.end(), diag.begin(), diag.end());
     expected.insert(expected.end(), {kRefresh, kLastLine});
     EXPECT_THAT(recovery_lines(), ElementsAreArray(expected));
-    EXPECT_EQ(diag_logging_state(), level_stops ? 0 : 1);
+    EXPECT_EQ(diag_logging_state(), level_stops ? diag_state::stopped : diag_state::logging);
     ASSERT_TRUE(tools.wait_for_calls(level_stops ? 3 : 2, 5000));
     handle = current_sensor1_handle();
   }
@@ -118,7 +118,7 @@ TEST_F(CallbackThreadsTest, WriteFailureWhileTheLinkIsRebuiltDoesNotDeadlock) {
   write_file(tools.dir() + "/diag_mdlog", "#!/bin/sh\necho \"diag_mdlog $*\" >> " + tools.dir() +
                                               "/calls\nwhile [ ! -e " + tools.dir() +
                                               "/go ]; do sleep 0.01; done\n");
-  set_diag_logging_state(1);
+  set_diag_logging_state(diag_state::logging);
   ASSERT_TRUE(sim->fault(FaultOp::kWrite, 5, 1));
   sim->callback(250, true, false, Header{}, {});
   ASSERT_TRUE(tools.wait_for_calls(1, 5000));
