@@ -606,45 +606,4 @@ void Simulator::set_connection_hook(ConnectionHook hook) {
   state_->connection_hook = std::move(hook);
 }
 
-std::vector<uint8_t> test_indication_body(uint8_t sensor_id, int32_t test_type, uint32_t result,
-                                          uint8_t error_valid, uint8_t error_code,
-                                          const std::vector<int32_t>& words) {
-  std::vector<uint8_t> b(84, 0);
-  store_u8(b.data(), 0, sensor_id);
-  store_i32(b.data(), 4, test_type);
-  store_u32(b.data(), 8, result);
-  store_u8(b.data(), 12, error_valid);
-  store_u8(b.data(), 13, error_code);
-  for (size_t i = 0; i < words.size() && i < 16; ++i) store_i32(b.data(), 20 + 4 * i, words[i]);
-  return b;
-}
-
-std::vector<uint8_t> sample_indication_body(uint8_t sensor_id, uint8_t data_type, int32_t x,
-                                            int32_t y, int32_t z) {
-  std::vector<uint8_t> b(24, 0);
-  store_u8(b.data(), 8, sensor_id);
-  store_u8(b.data(), 9, data_type);
-  store_i32(b.data(), 12, x);
-  store_i32(b.data(), 16, y);
-  store_i32(b.data(), 20, z);
-  return b;
-}
-
-std::vector<uint8_t> daf_indication_body(uint8_t code, uint8_t valid, uint32_t length,
-                                         const std::array<int32_t, 6>& data) {
-  std::vector<uint8_t> b(32, 0);
-  store_u8(b.data(), 0, code);
-  store_u8(b.data(), 1, valid);
-  store_u32(b.data(), 4, length);
-  for (size_t i = 0; i < data.size(); ++i) store_i32(b.data(), 8 + 4 * i, data[i]);
-  return b;
-}
-
-std::vector<uint8_t> common_response_body(uint8_t result, uint8_t error, size_t size) {
-  std::vector<uint8_t> b(std::max<size_t>(size, 2), 0);
-  b[0] = result;
-  b[1] = error;
-  return b;
-}
-
 }  // namespace kestrel_sim
