@@ -92,6 +92,11 @@ struct Simulator::State final : sensor1_host::Peer {
   bool healthy;
   int32_t refuse_result = 0;
   int refuse_count = 0;
+  Millis hold_for{0};
+  int hold_count = 0;
+  bool holding = false;                          // an OPEN answer is held now
+  uint64_t hold_releases = 0;                    // release_held_opens() calls so far
+  std::vector<std::vector<uint8_t>> after_held;  // records behind the next held answer
   int listen_fd = -1;
   std::vector<int> retired_listen_fds;  // closed by the connection thread
   std::vector<ConnPtr> conns;           // every connection not yet cleaned up
@@ -166,9 +171,23 @@ struct Simulator::State final : sensor1_host::Peer {
     cv.notify_all();
   }
 
+  // Holds the answer of an OPEN when asked to; returns the records that go out behind it.
+  std::vector<std::vector<uint8_t>> hold_open() {
+    std::unique_lock<std::mutex> lock(mu);
+    if (hold_count == 0) return {};
+    --hold_count;
+    holding = true;
+    const uint64_t releases = hold_releases;
+    cv.notify_all();
+    cv.wait_for(lock, hold_for, [&] { return stopping || hold_releases != releases; });
+    holding = false;
+    return std::move(after_held);
+  }
+
   void handle_open(const ConnPtr& c) {
     if (c->answered_open) return;
     c->answered_open = true;
+    const std::vector<std::vector<uint8_t>> behind = hold_open();
     int32_t result = 0;
     int number = 0;
     ConnectionHook hook;
@@ -191,8 +210,12 @@ struct Simulator::State final : sensor1_host::Peer {
       }
       const std::vector<uint8_t> rec =
           sensor1_wire::encode(sensor1_wire::result(sensor1_wire::kOpenResult, result));
-      sent = c->link != nullptr ? c->link->send(rec.data(), rec.size())
-                                : c->fd >= 0 && send_with_timeout(c->fd, rec, kSendTimeout);
+      auto send_now = [&](const std::vector<uint8_t>& r) {
+        return c->link != nullptr ? c->link->send(r.data(), r.size())
+                                  : c->fd >= 0 && send_with_timeout(c->fd, r, kSendTimeout);
+      };
+      sent = send_now(rec);
+      for (size_t i = 0; sent && result == 0 && i < behind.size(); ++i) sent = send_now(behind[i]);
     }
     if (!sent || result != 0) {
       if (c->link != nullptr) {
@@ -403,6 +426,7 @@ Simulator::~Simulator() {
     std::lock_guard<std::mutex> lock(state_->mu);
     state_->stopping = true;
   }
+  state_->cv.notify_all();  // a held OPEN answer goes out now
   if (state_->io.joinable()) {
     state_->wake_io();
     state_->io.join();
@@ -450,6 +474,25 @@ void Simulator::refuse_opens(int32_t result, int count) {
   std::lock_guard<std::mutex> lock(state_->mu);
   state_->refuse_result = result;
   state_->refuse_count = count;
+}
+
+void Simulator::hold_opens(Millis hold, int count) {
+  std::lock_guard<std::mutex> lock(state_->mu);
+  state_->hold_for = hold;
+  state_->hold_count = count;
+}
+
+void Simulator::release_held_opens() {
+  {
+    std::lock_guard<std::mutex> lock(state_->mu);
+    ++state_->hold_releases;
+  }
+  state_->cv.notify_all();
+}
+
+bool Simulator::wait_for_held_open(Millis timeout) {
+  std::unique_lock<std::mutex> lock(state_->mu);
+  return state_->cv.wait_for(lock, timeout, [&] { return state_->holding; });
 }
 
 void Simulator::stop_listening() {
@@ -551,14 +594,30 @@ void Simulator::retry_open() {
                   sensor1_wire::encode(sensor1_wire::plain(sensor1_wire::kRetryOpen)));
 }
 
-void Simulator::callback(int32_t msg_type, bool with_header, bool with_body, Header header,
-                         const std::vector<uint8_t>& body) {
+namespace {
+
+std::vector<uint8_t> callback_record(int32_t msg_type, bool with_header, bool with_body,
+                                     const Header& header, const std::vector<uint8_t>& body) {
   sensor1_wire::Record rec =
       sensor1_wire::message(sensor1_wire::kCallback, header, body.data(), body.size());
   rec.value = msg_type;
   rec.flags = static_cast<uint8_t>((with_header ? sensor1_wire::kWithHeader : 0) |
                                    (with_body ? sensor1_wire::kWithBody : 0));
-  state_->send_to(state_->current_conn(), sensor1_wire::encode(rec));
+  return sensor1_wire::encode(rec);
+}
+
+}  // namespace
+
+void Simulator::callback(int32_t msg_type, bool with_header, bool with_body, Header header,
+                         const std::vector<uint8_t>& body) {
+  state_->send_to(state_->current_conn(),
+                  callback_record(msg_type, with_header, with_body, header, body));
+}
+
+void Simulator::callback_after_held_open(int32_t msg_type, bool with_header, bool with_body,
+                                         Header header, const std::vector<uint8_t>& body) {
+  std::lock_guard<std::mutex> lock(state_->mu);
+  state_->after_held.push_back(callback_record(msg_type, with_header, with_body, header, body));
 }
 
 bool Simulator::fault(FaultOp op, int32_t result, uint32_t count, Millis timeout) {

@@ -56,6 +56,18 @@ class Simulator {
 
   // The next count OPEN records are answered with result (11 EWOULDBLOCK, or any error code).
   void refuse_opens(int32_t result, int count);
+  // The next count OPEN records are answered only after hold, or sooner on release_held_opens():
+  // a slow service. The answer is held on the thread that reads the connection (the connection
+  // thread, in process the opener's), so nothing else is read meanwhile and fault() times out.
+  void hold_opens(Millis hold, int count);
+  void release_held_opens();
+  // True once an OPEN answer is being held, within timeout.
+  bool wait_for_held_open(Millis timeout);
+  // A callback record (as callback() builds it) that goes out right behind the next successful
+  // held answer, before any other record reaches that connection: the library has it as soon as
+  // its open returns, e.g. a broken pipe (250) of a link that breaks while it is being opened.
+  void callback_after_held_open(int32_t msg_type, bool with_header, bool with_body, Header header,
+                                const std::vector<uint8_t>& body);
 
   // Stops accepting (the socket file is removed, so sensor1_open gets 11) or starts again.
   void stop_listening();
