@@ -68,8 +68,10 @@ uint32_t bigdata_request_id(uint32_t command) {
 
 uint8_t bigdata_txn_id(uint32_t request_id) {
   // The callback forwards the answers to 100006..100009 by these transaction ids.
-  if (request_id == 100008 || request_id == 100009) return kTxnHdThreshold;
-  if (request_id == 100006 || request_id == 100007) return kTxnThreshold;
+  if (request_id >= kDafHdThresholdFirst && request_id <= kDafHdThresholdLast) {
+    return kTxnHdThreshold;
+  }
+  if (request_id >= kDafThresholdFirst && request_id <= kDafThresholdLast) return kTxnThreshold;
   return kTxnDaf;
 }
 

@@ -78,6 +78,15 @@ static_assert(offsetof(daf_request, data_length) == 24, "");
 static_assert(offsetof(daf_request, data) == 28, "");
 static_assert(offsetof(daf_request, trailing_flag) == 284, "");
 
+// TestType values of the single-sensor test request.
+constexpr uint32_t kTestTypeOther = 3;  // status poll, and the calibrations that name no other
+constexpr uint32_t kTestTypeSelftest = 6;
+constexpr uint32_t kTestTypeFuseRom = 9;
+constexpr uint32_t kTestTypeRegisters = 10;
+constexpr uint32_t kTestTypeLpfOn = 11;
+constexpr uint32_t kTestTypeLpfOff = 12;
+constexpr uint32_t kTestTypeGyroTemperature = 13;
+
 // daf_request_id values.
 constexpr uint32_t kDafLightStreamStart = 60;
 constexpr uint32_t kDafLightStreamStop = 62;
@@ -88,6 +97,12 @@ constexpr uint32_t kDafHiddenHole = 100010;
 constexpr uint32_t kDafMotorEnabled = 100011;
 constexpr uint32_t kDafMotorDisabled = 100012;
 constexpr uint32_t kDafRegisterDump = 100015;
+// Bulk-data requests whose responses carry threshold words (txn 167) or hidden-hole thresholds
+// (txn 168).
+constexpr uint32_t kDafThresholdFirst = 100006;
+constexpr uint32_t kDafThresholdLast = 100007;
+constexpr uint32_t kDafHdThresholdFirst = 100008;
+constexpr uint32_t kDafHdThresholdLast = 100009;
 
 // SNS_SMGR_REPORT_REQ_V01: service 0, msg 2, 272 bytes, txn 2. Offsets of the written fields.
 constexpr uint16_t kReportRequestSize = 272;

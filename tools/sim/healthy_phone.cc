@@ -58,22 +58,25 @@ struct TestWords {
 const TestWords kTestWords[] = {
     // Pass; output with self test off in mg (gravity on z); self-test status and the self-test
     // deltas in mg.
-    {kSmgrAccel, 6, Options::kAny, {1, 12, -8, 1003, 1, 310, -295, 380}},
-    {kSmgrAccel, 11, Options::kAny, {11, 1}},                         // low-pass filter on
-    {kSmgrAccel, 12, Options::kAny, {12, 0}},                         // low-pass filter off
+    {kSmgrAccel, kTestTypeSelftest, Options::kAny, {1, 12, -8, 1003, 1, 310, -295, 380}},
+    {kSmgrAccel, kTestTypeLpfOn, Options::kAny, {11, 1}},             // low-pass filter on
+    {kSmgrAccel, kTestTypeLpfOff, Options::kAny, {12, 0}},            // low-pass filter off
     {kSmgrAccel, kAnyTest, Options::kCalibration, {1, 23, -41, 12}},  // offsets in mg
     {kSmgrAccel, kAnyTest, Options::kAny, {1}},
     // Self test, pass, zero-rate offsets in milli-dps x 1000, pass again, the outputs with self
     // test off and on.
-    {kSmgrGyro, 6, Options::kAny, {1, 1, 1250, -830, 410, 1, 12, -9, 5, 412, -391, 437}},
-    {kSmgrGyro, 13, Options::kAny, {2, q16(27.5)}},                 // temperature, degC
-    {kSmgrGyro, kAnyTest, Options::kAny, {3, 1, 1250, -830, 410}},  // calibration: zero rate
+    {kSmgrGyro,
+     kTestTypeSelftest,
+     Options::kAny,
+     {1, 1, 1250, -830, 410, 1, 12, -9, 5, 412, -391, 437}},
+    {kSmgrGyro, kTestTypeGyroTemperature, Options::kAny, {2, q16(27.5)}},  // temperature, degC
+    {kSmgrGyro, kAnyTest, Options::kAny, {3, 1, 1250, -830, 410}},         // calibration: zero rate
     // Pass, no error, the self-test field per axis and the raw readings behind it.
-    {kSmgrMag, 6, Options::kAny, {1, 0, -30, 20, -700, 35, -42, 180, 1, 1}},
-    {kSmgrMag, 9, Options::kAny, {2, -3, 1}},  // sensitivity adjustment
+    {kSmgrMag, kTestTypeSelftest, Options::kAny, {1, 0, -30, 20, -700, 35, -42, 180, 1, 1}},
+    {kSmgrMag, kTestTypeFuseRom, Options::kAny, {2, -3, 1}},  // sensitivity adjustment
     // WIA1, WIA2, ST1, HXL, HXH, HYL, HYH, HZL, HZH, TMPS, ST2, CNTL2, CNTL3, TS1.
     {kSmgrMag,
-     10,
+     kTestTypeRegisters,
      Options::kAny,
      {0x48, 0x09, 0x01, 0x2C, 0x00, 0xE4, 0xFF, 0x8A, 0xFE, 0x00, 0x18, 0x08, 0x00, 0x00}},
     {kSmgrMag, kAnyTest, Options::kCalibration, {1, 14, -6, 9}},  // hard-iron offsets
@@ -102,9 +105,13 @@ struct TestName {
   const char* name;
 };
 const TestName kTestNames[] = {
-    {3, "test"},           {6, "self test"},           {9, "fuse ROM read"},
-    {10, "register read"}, {11, "low-pass filter on"}, {12, "low-pass filter off"},
-    {13, "temperature"},
+    {kTestTypeOther, "test"},
+    {kTestTypeSelftest, "self test"},
+    {kTestTypeFuseRom, "fuse ROM read"},
+    {kTestTypeRegisters, "register read"},
+    {kTestTypeLpfOn, "low-pass filter on"},
+    {kTestTypeLpfOff, "low-pass filter off"},
+    {kTestTypeGyroTemperature, "temperature"},
 };
 
 const char* test_name(int32_t test_type, bool calibration) {
@@ -154,8 +161,13 @@ const DafKind kDafKinds[] = {
     {kDafMotorDisabled, kDafMotorDisabled, "motor disabled", DafAction::kNone, 0, {}},
     {kDafRegisterDump, kDafRegisterDump, "register dump", DafAction::kRegisterDump, 0, {}},
     {kDafHiddenHole, kDafHiddenHole, "hidden-hole coefficients", DafAction::kNone, 0, {}},
-    {100006, 100007, "thresholds", DafAction::kNone, 0, {2600, 1800, 0, 0}},
-    {100008, 100009, "hidden-hole thresholds", DafAction::kNone, 0, {0, 0, 3100, 2300}},
+    {kDafThresholdFirst, kDafThresholdLast, "thresholds", DafAction::kNone, 0, {2600, 1800, 0, 0}},
+    {kDafHdThresholdFirst,
+     kDafHdThresholdLast,
+     "hidden-hole thresholds",
+     DafAction::kNone,
+     0,
+     {0, 0, 3100, 2300}},
     {kDafBigdataFirst, kDafHiddenHole - 1, "bulk data", DafAction::kNone, 0, {}},
 };
 const DafKind kOtherDaf = {0, UINT32_MAX, "driver request", DafAction::kNone, 0, {}};
@@ -370,7 +382,9 @@ void HealthyPhone::answer_status(const Request& req, const PhoneKnobs& knobs) {
   respond(req, common_response_body(c.result, c.error, kStatusResponseSize));
   // A sensor that answers its status poll reports a finished test of type 3.
   const uint8_t id = record_of<status_request>(req.body).sensor_id;
-  if (test_words(id, 3, false) != nullptr) indicate_test(req, knobs, id, 3, {});
+  if (test_words(id, kTestTypeOther, false) != nullptr) {
+    indicate_test(req, knobs, id, kTestTypeOther, {});
+  }
 }
 
 void HealthyPhone::answer_test(const Request& req, const PhoneKnobs& knobs) {
