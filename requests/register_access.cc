@@ -15,20 +15,13 @@ namespace {
 
 constexpr int32_t kReadFuseRom = 8;
 constexpr int32_t kReadRegisters = 9;
-constexpr uint32_t kTestTypeFuseRom = 9;
-constexpr uint32_t kTestTypeRegisters = 10;
-constexpr uint32_t kTestTypeOther = 3;
 constexpr int32_t kMagReplyCode = 2;
 
 constexpr int32_t kLpfOn = 12;
 constexpr int32_t kLpfOff = 13;
-constexpr uint32_t kTestTypeLpfOn = 11;
-constexpr uint32_t kTestTypeLpfOff = 12;
 
 constexpr int32_t kMotorEnabled = 14;
 constexpr int32_t kMotorDisabled = 15;
-
-constexpr uint32_t kLastDumpSensorType = 5;
 
 // The fuse-ROM value of an axis scales its samples by value / 128 + 1.
 float sensitivity_of(int32_t fuse_rom) {

@@ -10,6 +10,16 @@
 namespace kestrelctl {
 namespace {
 
+// Live, SIGINT and SIGTERM come only while the reader waits, so that none is missed between the
+// check of the flag and the wait.
+void mask_interrupts(int how) {
+  sigset_t interrupts;
+  sigemptyset(&interrupts);
+  sigaddset(&interrupts, SIGINT);
+  sigaddset(&interrupts, SIGTERM);
+  sigprocmask(how, &interrupts, nullptr);
+}
+
 // The time stamp of a captured datagram, in text (UTC time of day) and in JSON (seconds).
 std::string stamp(const struct timeval& time, bool json) {
   char buf[64];
@@ -78,6 +88,7 @@ int decode_packets(Session& session, CaptureReader* reader, bool live) {
     }
     frames += print_packet(session, p, &samples);
   }
+  if (live) mask_interrupts(SIG_UNBLOCK);
   session.note(std::to_string(frames) + " frames of netlink protocol 23; " +
                std::to_string(foreign) + " packets of other protocols skipped");
   const int written = session.write_samples(samples);
@@ -110,12 +121,7 @@ int decode_live(Session& session, const Command&) {
     session.note(error);
     return kExitFile;
   }
-  // SIGINT and SIGTERM come only while the reader waits, so none is missed before the wait.
-  sigset_t interrupts;
-  sigemptyset(&interrupts);
-  sigaddset(&interrupts, SIGINT);
-  sigaddset(&interrupts, SIGTERM);
-  sigprocmask(SIG_BLOCK, &interrupts, nullptr);
+  mask_interrupts(SIG_BLOCK);
   catch_interrupts();
   session.note(
       "listening on " + interface + ", link type " + reader.link_type_name() +

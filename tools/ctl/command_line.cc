@@ -15,8 +15,8 @@ port (KESTREL_KERNEL_PORT, default 100).
 
 const char* const kSectionHeads[] = {
     "Commands that wait for their reply (exit status 1 when it does not come in time):\n",
-    "\nCommands that only send (they leave the kernel's port free, so that a `kestrelctl listen`\n"
-    "in another terminal shows what the daemon answers):\n",
+    ("\nCommands that only send (they leave the kernel's port free, so that a `kestrelctl listen`\n"
+     "in another terminal shows what the daemon answers):\n"),
     "\n",
     "\nCaptures:\n",
 };

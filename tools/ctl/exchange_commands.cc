@@ -4,6 +4,7 @@
 
 #include "handlers.h"
 #include "kernel_frame.h"
+#include "kernel_sensors.h"
 #include "sensor_names.h"
 
 namespace kestrelctl {
@@ -43,14 +44,15 @@ int exchange(Session& session, const Command& command) {
 int selftest(Session& session, const Command&) {
   const int32_t sensor_type = sensor_argument(session.arguments()[0]);
   const std::vector<uint8_t> frame = build_command(NETLINK_MESSAGE_SELFTEST, {sensor_type});
-  const int32_t id = smgr_id_of(sensor_type);
+  const int32_t id = smgr_id_by_sensor_type(sensor_type);
   const double timeout = session.reply_timeout();
   // The gyroscope's reply is frame 14, or frame 10 when its last result was a temperature.
-  if (id == 10) {
+  if (id == kSmgrGyro) {
     return session.send_and_wait(frame, {FRAME_GYRO_SELFTEST, FRAME_GYRO_TEMPERATURE}, timeout);
   }
-  if (id == 0 || id == 20 || id == 30)
+  if (id == kSmgrAccel || id == kSmgrMag || id == kSmgrPressure) {
     return session.send_and_wait(frame, {FRAME_SELFTEST}, timeout);
+  }
   return send_unanswered(session, frame,
                          "the daemon replies to self tests of the accel, gyro, mag and pressure "
                          "sensor types only");
@@ -59,7 +61,7 @@ int selftest(Session& session, const Command&) {
 int dump(Session& session, const Command&) {
   const int32_t sensor_type = sensor_argument(session.arguments()[0]);
   const std::vector<uint8_t> frame = build_command(NETLINK_MESSAGE_DUMP_REGISTER, {sensor_type});
-  if (sensor_type < 0 || sensor_type > 5) {
+  if (sensor_type < 0 || sensor_type > kLastDumpSensorType) {
     return send_unanswered(session, frame,
                            "the daemon dumps the registers of sensor types 0 to 5 only");
   }
@@ -79,7 +81,9 @@ int calib_store(Session& session, const Command&) {
 int bigdata(Session& session, const Command&) {
   const std::string& number = session.arguments()[0];
   const int32_t command = number_argument("command", number);
-  if (!is_bigdata_command(static_cast<uint32_t>(command)) || command < 0) {
+  const bigdata_kind* kind =
+      command < 0 ? nullptr : bigdata_kind_of(static_cast<uint32_t>(command));
+  if (kind == nullptr) {
     throw UsageError("command " + number +
                      " is no bulk-data command: use 22 to 26, 28, 29, 31 or 32");
   }
@@ -88,17 +92,10 @@ int bigdata(Session& session, const Command&) {
     throw UsageError("bulk data of " + std::to_string(data.size()) +
                      " bytes: the driver takes at most 256 (send anything else with raw)");
   }
-  const std::vector<uint8_t> frame =
-      build_bigdata(static_cast<uint16_t>(command), kLightSensorType, data);
-  // The light sensor's driver answers the threshold reads (28, 29) and the hd threshold reads
-  // (31, 32); the other kinds have no data to answer with.
-  const double timeout = session.reply_timeout(kBigdataTimeoutSeconds);
-  if (command == 28 || command == 29)
-    return session.send_and_wait(frame, {FRAME_THRESHOLD}, timeout);
-  if (command == 31 || command == 32) {
-    return session.send_and_wait(frame, {FRAME_HD_THRESHOLD}, timeout);
-  }
-  return session.send_only(frame);
+  const std::vector<uint8_t> frame = build_bigdata(kind->command, SENSOR_TYPE_LIGHT, data);
+  if (kind->reply_frame < 0) return session.send_only(frame);
+  return session.send_and_wait(frame, {static_cast<uint16_t>(kind->reply_frame)},
+                               session.reply_timeout(kBigdataTimeoutSeconds));
 }
 
 int send_words(Session& session, const Command&) {

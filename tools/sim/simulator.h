@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "sensor1_wire.h"
+#include "tools/sim/phone_bodies.h"  // the bodies tests send through the simulator
 
 namespace kestrel_sim {
 
@@ -55,6 +56,18 @@ class Simulator {
 
   // The next count OPEN records are answered with result (11 EWOULDBLOCK, or any error code).
   void refuse_opens(int32_t result, int count);
+  // The next count OPEN records are answered only after hold, or sooner on release_held_opens():
+  // a slow service. The answer is held on the thread that reads the connection (the connection
+  // thread, in process the opener's), so nothing else is read meanwhile and fault() times out.
+  void hold_opens(Millis hold, int count);
+  void release_held_opens();
+  // True once an OPEN answer is being held, within timeout.
+  bool wait_for_held_open(Millis timeout);
+  // A callback record (as callback() builds it) that goes out right behind the next successful
+  // held answer, before any other record reaches that connection: the library has it as soon as
+  // its open returns, e.g. a broken pipe (250) of a link that breaks while it is being opened.
+  void callback_after_held_open(int32_t msg_type, bool with_header, bool with_body, Header header,
+                                const std::vector<uint8_t>& body);
 
   // Stops accepting (the socket file is removed, so sensor1_open gets 11) or starts again.
   void stop_listening();
@@ -113,19 +126,5 @@ class Simulator {
   struct State;
   std::unique_ptr<State> state_;
 };
-
-// Bodies of the sensor service, as the daemon reads them. Shared by the healthy phone and tests.
-// A single-sensor test indication (84 bytes): words go to offsets 20, 24, ... (at most 16).
-std::vector<uint8_t> test_indication_body(uint8_t sensor_id, int32_t test_type, uint32_t result,
-                                          uint8_t error_valid, uint8_t error_code,
-                                          const std::vector<int32_t>& words);
-// A sample indication (24 bytes).
-std::vector<uint8_t> sample_indication_body(uint8_t sensor_id, uint8_t data_type, int32_t x,
-                                            int32_t y, int32_t z);
-// A daf_indication (32 bytes).
-std::vector<uint8_t> daf_indication_body(uint8_t code, uint8_t valid, uint32_t length,
-                                         const std::array<int32_t, 6>& data);
-// A response of the common form: result, error, then zeros up to size bytes.
-std::vector<uint8_t> common_response_body(uint8_t result, uint8_t error, size_t size = 2);
 
 }  // namespace kestrel_sim
