@@ -112,9 +112,10 @@ if [ "${VM_ACCEL:-}" != tcg ] && [ -n "$kvm_cpu" ] && [ -w /dev/kvm ] &&
   accel=(-accel kvm -cpu "$kvm_cpu")
 fi
 echo "booting with ${accel[*]}"
+mapfile -t results < <(results_args "$out/results.b64")
 boot=$SECONDS
 timeout "${VM_TIMEOUT:-170}" "${qemu[@]}" "${accel[@]}" -display none -nodefaults -no-reboot \
-  -serial stdio $(results_args "$out/results.b64") -kernel "$kimage" -initrd "$out/initramfs.gz" \
+  -serial stdio "${results[@]}" -kernel "$kimage" -initrd "$out/initramfs.gz" \
   -append "console=$console panic=-1 loglevel=3 rdinit=/init" < /dev/null |
   tr -d '\r' | tee "$out/console.log" | grep -E '^(PASS|FAIL|boot|sent) ' || true
 sed -i '/passed, .* failed (in the VM)/d' "$out/console.log"
