@@ -94,9 +94,8 @@ struct Simulator::State final : sensor1_host::Peer {
   int refuse_count = 0;
   Millis hold_for{0};
   int hold_count = 0;
-  bool holding = false;                          // an OPEN answer is held now
-  uint64_t hold_releases = 0;                    // release_held_opens() calls so far
-  std::vector<std::vector<uint8_t>> after_held;  // records behind the next held answer
+  ConnPtr held;                // the connection whose OPEN answer is held now
+  uint64_t hold_releases = 0;  // release_held_opens() calls so far
   int listen_fd = -1;
   std::vector<int> retired_listen_fds;  // closed by the connection thread
   std::vector<ConnPtr> conns;           // every connection not yet cleaned up
@@ -171,23 +170,22 @@ struct Simulator::State final : sensor1_host::Peer {
     cv.notify_all();
   }
 
-  // Holds the answer of an OPEN when asked to; returns the records that go out behind it.
-  std::vector<std::vector<uint8_t>> hold_open() {
+  // Holds the answer of an OPEN when asked to.
+  void hold_open(const ConnPtr& c) {
     std::unique_lock<std::mutex> lock(mu);
-    if (hold_count == 0) return {};
+    if (hold_count == 0) return;
     --hold_count;
-    holding = true;
+    held = c;
     const uint64_t releases = hold_releases;
     cv.notify_all();
     cv.wait_for(lock, hold_for, [&] { return stopping || hold_releases != releases; });
-    holding = false;
-    return std::move(after_held);
+    held.reset();
   }
 
   void handle_open(const ConnPtr& c) {
     if (c->answered_open) return;
     c->answered_open = true;
-    const std::vector<std::vector<uint8_t>> behind = hold_open();
+    hold_open(c);
     int32_t result = 0;
     int number = 0;
     ConnectionHook hook;
@@ -210,12 +208,8 @@ struct Simulator::State final : sensor1_host::Peer {
       }
       const std::vector<uint8_t> rec =
           sensor1_wire::encode(sensor1_wire::result(sensor1_wire::kOpenResult, result));
-      auto send_now = [&](const std::vector<uint8_t>& r) {
-        return c->link != nullptr ? c->link->send(r.data(), r.size())
-                                  : c->fd >= 0 && send_with_timeout(c->fd, r, kSendTimeout);
-      };
-      sent = send_now(rec);
-      for (size_t i = 0; sent && result == 0 && i < behind.size(); ++i) sent = send_now(behind[i]);
+      sent = c->link != nullptr ? c->link->send(rec.data(), rec.size())
+                                : c->fd >= 0 && send_with_timeout(c->fd, rec, kSendTimeout);
     }
     if (!sent || result != 0) {
       if (c->link != nullptr) {
@@ -492,7 +486,7 @@ void Simulator::release_held_opens() {
 
 bool Simulator::wait_for_held_open(Millis timeout) {
   std::unique_lock<std::mutex> lock(state_->mu);
-  return state_->cv.wait_for(lock, timeout, [&] { return state_->holding; });
+  return state_->cv.wait_for(lock, timeout, [&] { return state_->held != nullptr; });
 }
 
 void Simulator::stop_listening() {
@@ -614,10 +608,14 @@ void Simulator::callback(int32_t msg_type, bool with_header, bool with_body, Hea
                   callback_record(msg_type, with_header, with_body, header, body));
 }
 
-void Simulator::callback_after_held_open(int32_t msg_type, bool with_header, bool with_body,
-                                         Header header, const std::vector<uint8_t>& body) {
-  std::lock_guard<std::mutex> lock(state_->mu);
-  state_->after_held.push_back(callback_record(msg_type, with_header, with_body, header, body));
+bool Simulator::callback_to_held_open(int32_t msg_type, bool with_header, bool with_body,
+                                      Header header, const std::vector<uint8_t>& body) {
+  ConnPtr c;
+  {
+    std::lock_guard<std::mutex> lock(state_->mu);
+    c = state_->held;
+  }
+  return state_->send_to(c, callback_record(msg_type, with_header, with_body, header, body));
 }
 
 bool Simulator::fault(FaultOp op, int32_t result, uint32_t count, Millis timeout) {
