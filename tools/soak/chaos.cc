@@ -477,6 +477,7 @@ int Chaos::run() {
          last_.rss_kb, last_.anon_kb, last_.descriptors, last_.threads);
   if (overruns_ > 0) printf("chaos: the kernel port's queue overflowed %ld times\n", overruns_);
   check(ok_, "the daemon ended only with the close's result, and settled each time");
+  check(log_.seen["on a closed handle"] == 0, "no sensor1 call on a closed handle");
   check(faults > 0 && commands_ > 0 && slowest_ms_ <= static_cast<double>(bound.count()),
         "every command done within the scaled wait and the margin");
   check(reference_ok && final_ok && !reference.empty() && final_frames == reference,

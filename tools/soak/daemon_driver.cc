@@ -125,6 +125,7 @@ const char* const kLogPatterns[] = {
     "alloc_msg_buf error",
     "get_raw error",
     "BROKEN_PIPE",
+    "on a closed handle",
     "malformed",
     "refused",
     "cb has arrived without waiting",
