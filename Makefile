@@ -2,7 +2,7 @@
 # missing through apt-get when run as root, and say what to install otherwise.
 BUILD ?= build
 
-.PHONY: all build deps test demo fuzz clean arm64-test bench soak chaos
+.PHONY: all build deps test demo fuzz clean arm64-test vm-test bench soak chaos
 
 all: build
 
@@ -30,6 +30,14 @@ fuzz:
 arm64-test:
 	@scripts/deps.sh arm64
 	@scripts/arm64_test.sh
+
+# The daemon against a real Linux kernel: the factory driver module (kernel/) built against the
+# headers of the kernel that boots under qemu, the daemon, kestrel-sim and kestrelctl in its
+# initramfs, a session through /dev/kestrel_factory captured on nlmon0 (scripts/vm_test.sh;
+# docs/device.md). ARCH=x86_64 by default.
+vm-test:
+	@scripts/deps.sh vm
+	@scripts/vm_test.sh
 
 # The benchmarks, built in Release in build-bench and run against their limits; rewrites
 # docs/performance.md with the figures (scripts/bench.sh).

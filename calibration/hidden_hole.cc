@@ -1,6 +1,6 @@
 // The light sensor's data from the kernel driver, passed on to its driver on the sensor processor
 // as daf_requests: the hidden-hole coefficients (command 35) and the opaque bulk-data blocks
-// (commands 22 to 26, 28, 29, 31 and 32). Neither waits: where the driver answers, the service
+// (kBigdataKinds). Neither waits: where the driver answers, the service
 // callback routes the answer by its transaction id.
 #include "hidden_hole.h"
 
@@ -39,39 +39,14 @@ int32_t bigdata_length(const uint8_t* frame, uint16_t command) {
   return length;
 }
 
-}  // namespace
-
-uint32_t bigdata_request_id(uint32_t command) {
-  switch (command) {
-    case 24:
-      return 100001;
-    case 25:
-      return 100002;
-    case 23:
-      return 100003;
-    case 22:
-      return 100004;
-    case 26:
-      return 100005;
-    case 28:
-      return 100006;
-    case 29:
-      return 100007;
-    case 31:
-      return 100008;
-    case 32:
-      return 100009;
-    default:
-      return 0;
-  }
-}
-
-uint8_t bigdata_txn_id(uint32_t request_id) {
-  // The callback forwards the answers to 100006..100009 by these transaction ids.
-  if (request_id == 100008 || request_id == 100009) return kTxnHdThreshold;
-  if (request_id == 100006 || request_id == 100007) return kTxnThreshold;
+// The callback passes an answer on as the frame its transaction id stands for.
+uint8_t bigdata_txn_id(const bigdata_kind& kind) {
+  if (kind.reply_frame == FRAME_HD_THRESHOLD) return kTxnHdThreshold;
+  if (kind.reply_frame == FRAME_THRESHOLD) return kTxnThreshold;
   return kTxnDaf;
 }
+
+}  // namespace
 
 int set_hidden_hole_data(const uint8_t* frame) {
   static const char kName[] = "set_hidden_hole_data";
@@ -102,9 +77,9 @@ int set_hidden_hole_data(const uint8_t* frame) {
 int send_bigdata(const uint8_t* frame) {
   static const char kName[] = "send_bigdata";
   const uint16_t command = load_u16(frame, kFrameTypeOffset);
-  const uint32_t request_id = bigdata_request_id(command);
+  const bigdata_kind* kind = bigdata_kind_of(command);
   // Only the bulk-data commands are routed here; any other number has no request id to use.
-  if (request_id == 0) return -1;
+  if (kind == nullptr) return -1;
   const int32_t length = bigdata_length(frame, command);
   if (length < 0) return -1;
 
@@ -112,13 +87,13 @@ int send_bigdata(const uint8_t* frame) {
   const int32_t smgr_id = smgr_id_by_sensor_type(sensor_type);
   sensor1_request req;
   if (!begin_request(&req, kName, sensor_type, kServiceDaf, kMsgDafRequest, kDafRequestSize,
-                     bigdata_txn_id(request_id), alloc_failure_text::kPlain)) {
+                     bigdata_txn_id(*kind), alloc_failure_text::kPlain)) {
     return -1;
   }
   KLOGI("%s: type:%d, id:%d", kName, command, smgr_id);
 
   write_daf_suid(req.body, light_sensor_suid);
-  write_daf_request_id(req.body, request_id);
+  write_daf_request_id(req.body, kind->daf_request_id);
   write_daf_data(req.body, frame + kBulkDataOffset, static_cast<uint32_t>(length));
 
   const int r = write_request(&req);

@@ -10,7 +10,3 @@ int set_hidden_hole_data(const uint8_t* frame);
 // error line ("send_bigdata: command 24 refused: data length 300 (frame carries 8 bytes, at
 // most 256)") before anything else is done: no request, no copy.
 int send_bigdata(const uint8_t* frame);
-
-// daf_request_id of a bulk-data command (0 for numbers outside the family), and its txn_id.
-uint32_t bigdata_request_id(uint32_t command);
-uint8_t bigdata_txn_id(uint32_t request_id);

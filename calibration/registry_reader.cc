@@ -84,6 +84,49 @@ int open_registry() {
   return r;
 }
 
+// Reads every item of table into buffers and the report's words, logs the words of the codes
+// that log them, and sets the result: errors (the open's) or a failed read clear the words the
+// code loses and make it -1.
+void fill_report(const item_table& table, int errors, uint8_t* (&buffers)[kSlots],
+                 calibration_report* report) {
+  const int32_t pdata = report->pdata_sensor_type;
+  uint8_t lengths[kSlots] = {};
+  uint8_t length = 0;  // one length byte for every read, as the library reports it
+  for (int slot = 0; slot < table.count; ++slot) {
+    const registry_item& item = table.items[slot];
+    errors |= sensor_reg_read(item.id, kReadArgument, &buffers[slot], &length);
+    lengths[slot] = length;
+    if (table.how == decoding::kLittleEndian && length != 0) {
+      report->word[item.word] =
+          decode_little_endian(report->word[item.word], buffers[slot], &length);
+    }
+  }
+  if (errors == 0 && table.how == decoding::kFirstByte) {
+    bool any = false;
+    for (int slot = 0; slot < table.count; ++slot) {
+      const uint8_t v = (buffers[slot] != nullptr && lengths[slot] != 0) ? buffers[slot][0] : 0;
+      report->word[table.items[slot].word] = v;
+      any = any || v != 0;
+    }
+    // The accelerometer's offsets count as present only when one of them is non-zero.
+    report->result = pdata != 0 ? 0 : (any ? 1 : -1);
+  }
+  const uint32_t* word = report->word;
+  if (pdata == 2) {
+    KLOGI("SI param 0x%08x 0x%08x 0x%08x 0x%08x 0x%08x 0x%08x 0x%08x 0x%08x 0x%08x ", word[0],
+          word[1], word[2], word[3], word[4], word[5], word[6], word[7], word[8]);
+  } else if (pdata == 5) {
+    KLOGI("pdata.trim %d", static_cast<int32_t>(word[4]));
+  }
+  if (errors == 0 && table.how == decoding::kLittleEndian) report->result = 0;
+  if (errors != 0) {
+    // The soft-iron parameters are all or nothing; the other codes lose words 0..2 only.
+    const int cleared = pdata == 2 ? 9 : 3;
+    for (int w = 0; w < cleared; ++w) report->word[w] = 0;
+    report->result = -1;
+  }
+}
+
 }  // namespace
 
 int read_calib_data(const uint8_t* frame) {
@@ -96,46 +139,10 @@ int read_calib_data(const uint8_t* frame) {
   report.pdata_sensor_type = pdata;
   report.result = -1;
   uint8_t* buffers[kSlots] = {};
-  uint8_t lengths[kSlots] = {};
-  uint8_t length = 0;  // one length byte for every read, as the library reports it
 
-  int errors = open_registry();
+  const int errors = open_registry();
   const item_table* table = table_for(pdata);
-  if (table != nullptr) {
-    for (int slot = 0; slot < table->count; ++slot) {
-      const registry_item& item = table->items[slot];
-      errors |= sensor_reg_read(item.id, kReadArgument, &buffers[slot], &length);
-      lengths[slot] = length;
-      if (table->how == decoding::kLittleEndian && length != 0) {
-        report.word[item.word] =
-            decode_little_endian(report.word[item.word], buffers[slot], &length);
-      }
-    }
-    if (errors == 0 && table->how == decoding::kFirstByte) {
-      bool any = false;
-      for (int slot = 0; slot < table->count; ++slot) {
-        const uint8_t v = (buffers[slot] != nullptr && lengths[slot] != 0) ? buffers[slot][0] : 0;
-        report.word[table->items[slot].word] = v;
-        any = any || v != 0;
-      }
-      // The accelerometer's offsets count as present only when one of them is non-zero.
-      report.result = pdata != 0 ? 0 : (any ? 1 : -1);
-    }
-    if (pdata == 2) {
-      KLOGI("SI param 0x%08x 0x%08x 0x%08x 0x%08x 0x%08x 0x%08x 0x%08x 0x%08x 0x%08x ",
-            report.word[0], report.word[1], report.word[2], report.word[3], report.word[4],
-            report.word[5], report.word[6], report.word[7], report.word[8]);
-    } else if (pdata == 5) {
-      KLOGI("pdata.trim %d", static_cast<int32_t>(report.word[4]));
-    }
-    if (errors == 0 && table->how == decoding::kLittleEndian) report.result = 0;
-    if (errors != 0) {
-      // The soft-iron parameters are all or nothing; the other codes lose words 0..2 only.
-      const int cleared = pdata == 2 ? 9 : 3;
-      for (int w = 0; w < cleared; ++w) report.word[w] = 0;
-      report.result = -1;
-    }
-  }
+  if (table != nullptr) fill_report(*table, errors, buffers, &report);
 
   KLOGI("%s: ID=%d, Type=%d, Result=%d, Val=%d,%d,%d", kName, smgr_id, pdata, report.result,
         static_cast<int32_t>(report.word[0]), static_cast<int32_t>(report.word[1]),

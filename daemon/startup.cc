@@ -111,7 +111,7 @@ int kestreld_main() {
   KLOGI("%s SNS_DIAG_ENABLE_LOGGING enable\n", "main");
   if (pthread_create(&diag_thread, nullptr, diag_logging_start_thread, nullptr) != 0) {
     KLOGE("%s diag_logging_thread init err\n", "main");
-    set_diag_logging_state(0);
+    set_diag_logging_state(diag_state::stopped);
   } else {
     KLOGI("%s pthread_create success\n", "main");
   }

@@ -22,8 +22,9 @@ const char kDiagMdlogStop[] = "diag_mdlog -k -p 16";
 
 namespace {
 
-std::atomic<int32_t> diag_logging_state_value{0};
-static_assert(std::atomic<int32_t>::is_always_lock_free, "the state is one plain 32-bit word");
+std::atomic<diag_state> diag_logging_state_value{diag_state::stopped};
+static_assert(std::atomic<diag_state>::is_always_lock_free, "the state is one plain 32-bit word");
+static_assert(sizeof(diag_state) == 4, "the state is one plain 32-bit word");
 
 // The UART selection: text starting with "CP" means the phone is in DIAG mode; anything else
 // (such as "AP"), an empty file or no file at all does not.
@@ -44,11 +45,11 @@ int read_property(const char* name, char (&value)[PROP_VALUE_MAX]) {
 
 }  // namespace
 
-int32_t diag_logging_state() {
+diag_state diag_logging_state() {
   return diag_logging_state_value.load();
 }
 
-void set_diag_logging_state(int32_t state) {
+void set_diag_logging_state(diag_state state) {
   diag_logging_state_value.store(state);
 }
 
@@ -124,7 +125,7 @@ void sns_set_diag_tx_mode() {
   int allowed = check_property();
   if (allowed == 1) allowed = check_files();
   if (allowed < 0) {
-    set_diag_logging_state(0);
+    set_diag_logging_state(diag_state::stopped);
     KLOGI("%s: DM mode is setting\n", "sns_set_diag_tx_mode");
     return;
   }
@@ -137,14 +138,14 @@ void sns_set_diag_tx_mode() {
   run_shell_command(kDiagMdlogStart);
   // Logging counts as enabled, so that a dump may stop it, only 5 s after the tool started.
   platform_sleep_seconds(5);
-  set_diag_logging_state(1);
+  set_diag_logging_state(diag_state::logging);
 }
 
 void* diag_logging_start_thread(void*) {
   KLOGI("%s start\n", "diag_logging_start_thread");
   platform_sleep_seconds(3);
   if (check_loglevel()) {
-    set_diag_logging_state(0);
+    set_diag_logging_state(diag_state::stopped);
     return nullptr;
   }
   // The first open of the sensor service happens here, in practice; the handle is not needed.
@@ -162,7 +163,7 @@ void* diag_logging_thread(void*) {
   run_shell_command(kDiagMdlogStop);
   platform_sleep_seconds(2);
   // A stop (command 27 with argument 1, or a broken link) during the pause ends the dump here.
-  if (diag_logging_state() == 0) return nullptr;
+  if (diag_logging_state() == diag_state::stopped) return nullptr;
   sns_set_diag_tx_mode();
   return nullptr;
 }

@@ -249,13 +249,19 @@ void check_bodies_released() {
   }
 }
 
-void reset_daemon_state(int32_t diag_state) {
+void reset_daemon_state(diag_state diag) {
   reset_connection_for_testing();
   reset_response_waiters_for_testing();
   reset_factory_state_for_testing();
   reset_raw_data_flags_for_testing();
-  set_diag_logging_state(diag_state);
+  set_diag_logging_state(diag);
   fail_frame_block(0);
+}
+
+diag_state diag_state_of_bits(uint32_t bits) {
+  static const diag_state kStates[4] = {diag_state::stopped, diag_state::logging,
+                                        diag_state::dumping, diag_state::stopped};
+  return kStates[bits & 3];
 }
 
 void wait_for_daemon_threads() {

@@ -22,6 +22,7 @@
 
 #include <string>
 
+#include "diag/diag_logging.h"
 #include "tools/sim/healthy_phone.h"
 
 namespace kestrel_fuzz {
@@ -61,7 +62,10 @@ extern const char kCalibratedRegistry[];
 
 // The daemon's process state back to its start: no connection and a full open budget, no pending
 // hand-over, empty results, first-stream flags, the DIAG state given, the frame allocator plain.
-void reset_daemon_state(int32_t diag_state);
+void reset_daemon_state(diag_state diag);
+
+// The DIAG state two bits of an input choose: stopped, logging, dumping, stopped.
+diag_state diag_state_of_bits(uint32_t bits);
 
 // Waits until every thread the daemon started has returned from its entry function, so that no
 // thread of one input still allocates or frees while the next input runs or while libFuzzer

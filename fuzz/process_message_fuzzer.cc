@@ -11,7 +11,7 @@
 // The scenario. The daemon never reads nlmsg_seq (frame bytes 8 to 11); the fuzzer reads the
 // first frame's as the state of the phone for this datagram, so the same walk also runs through
 // the failure paths:
-//   bits 0-1   DIAG logging state at the start: 0, 1, 3, 0
+//   bits 0-1   DIAG logging state at the start: stopped, logging, dumping, stopped
 //   bit 2      sensor1_alloc_msg_buf fails
 //   bit 3      sensor1_write fails with 32 (the body stays with the daemon)
 //   bit 4      sensor1_write returns 11 (the body is taken, nothing is answered)
@@ -56,8 +56,7 @@ uint32_t scenario_of(const uint8_t* data, size_t size) {
 }
 
 void set_scenario(uint32_t s) {
-  static const int32_t kDiagStates[4] = {0, 1, 3, 0};
-  kestrel_fuzz::reset_daemon_state(kDiagStates[s & 3]);
+  kestrel_fuzz::reset_daemon_state(kestrel_fuzz::diag_state_of_bits(s));
   kestrel_fuzz::phone_scenario b;
   b.alloc_result = (s & (1u << 2)) != 0 ? 12 : 0;
   if ((s & (1u << 3)) != 0) {

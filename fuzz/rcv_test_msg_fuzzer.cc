@@ -7,7 +7,7 @@
 //   4   u8   bit 0: a header is given; bit 1: a body is given
 //   5   u8   the process state before the call:
 //              bit 0     the connection is open
-//              bits 1-2  DIAG logging state 0, 1, 3, 0
+//              bits 1-2  DIAG logging state stopped, logging, dumping, stopped
 //              bit 3     magnetometer sensitivities 1.0 (else 0, as at start)
 //              bit 4     a reopen fails (sensor1_open returns 11)
 //              bit 5     "ro.debug_level" forbids logging
@@ -71,8 +71,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
   const bool with_body = (fields[4] & 2) != 0;
   const uint8_t state = fields[5];
 
-  static const int32_t kDiagStates[4] = {0, 1, 3, 0};
-  kestrel_fuzz::reset_daemon_state(kDiagStates[(state >> 1) & 3]);
+  kestrel_fuzz::reset_daemon_state(kestrel_fuzz::diag_state_of_bits(state >> 1u));
   kestrel_fuzz::set_phone_scenario({});
   if ((state & 1) != 0) get_handle_for_sensor(0);
   if ((state & 8) != 0) set_mag_sensitivity(1.0f, 1.0f, 1.0f);

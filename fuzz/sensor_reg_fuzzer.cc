@@ -62,7 +62,7 @@ void read_every_item() {
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
   g_paths = &kestrel_fuzz::setup_fuzz_environment(kestrel_fuzz::kNormalProperties, "");
-  kestrel_fuzz::reset_daemon_state(0);
+  kestrel_fuzz::reset_daemon_state(diag_state::stopped);
   return 0;
 }
 

@@ -45,12 +45,6 @@ enum kernel_command : uint16_t {
   NETLINK_MESSAGE_HH_FILE_PERMISSIONS = 36,
 };
 
-// Bulk-data commands: one family, the number itself selects the data kind.
-constexpr bool is_bigdata_command(uint32_t command) {
-  return (command >= 22 && command <= 26) || command == 28 || command == 29 || command == 31 ||
-         command == 32;
-}
-
 // Outbound frame types.
 enum kernel_frame_type : uint16_t {
   FRAME_STATUS = 0,
@@ -70,6 +64,37 @@ enum kernel_frame_type : uint16_t {
   FRAME_HD_THRESHOLD = 33,
   FRAME_HH_REFRESH = 34,
 };
+
+// The bulk-data commands: one family, the number itself selects the data kind, which the light
+// sensor's driver knows by its daf_request_id. The threshold reads are answered by the driver
+// and the daemon passes the answer on as a frame; the other kinds are not answered.
+struct bigdata_kind {
+  uint16_t command;
+  uint32_t daf_request_id;
+  int32_t reply_frame;  // a kernel_frame_type, or -1
+};
+constexpr bigdata_kind kBigdataKinds[] = {
+    {22, 100004, -1},
+    {23, 100003, -1},
+    {24, 100001, -1},
+    {25, 100002, -1},
+    {26, 100005, -1},
+    {28, 100006, FRAME_THRESHOLD},
+    {29, 100007, FRAME_THRESHOLD},
+    {31, 100008, FRAME_HD_THRESHOLD},
+    {32, 100009, FRAME_HD_THRESHOLD},
+};
+
+// The kind of a bulk-data command, null for numbers outside the family.
+constexpr const bigdata_kind* bigdata_kind_of(uint32_t command) {
+  for (const bigdata_kind& kind : kBigdataKinds) {
+    if (kind.command == command) return &kind;
+  }
+  return nullptr;
+}
+constexpr bool is_bigdata_command(uint32_t command) {
+  return bigdata_kind_of(command) != nullptr;
+}
 
 // nlmsg_len of an outbound frame: NLMSG_SPACE of the payload, alignment bytes included.
 constexpr uint32_t frame_space(uint32_t payload_length) {

@@ -120,26 +120,26 @@ void run_dump_register_command(const uint8_t* frame) {
 void run_diag_logging_command(const uint8_t* frame) {
   const int32_t argument = load_i32(frame, kArgumentOffset);
   if (argument == 1) {
-    set_diag_logging_state(0);
+    set_diag_logging_state(diag_state::stopped);
     run_shell_command(kDiagMdlogStop);
   } else if (argument == 0) {
-    const int32_t state = diag_logging_state();
-    if ((state & 1) == 0) {
+    const diag_state state = diag_logging_state();
+    if (state == diag_state::stopped) {
       KLOGI("diag : Diabled Logging System\n");
     } else {
-      KLOGI("diag : debugging_mode %x\n", state);
-      if ((state & 2) != 0) {
+      KLOGI("diag : debugging_mode %x\n", static_cast<int>(state));
+      if (state == diag_state::dumping) {
         KLOGI("diag : Logging System is running\n");
       } else {
-        set_diag_logging_state(3);
-        KLOGI("diag : To start logging %x\n", 3);
+        set_diag_logging_state(diag_state::dumping);
+        KLOGI("diag : To start logging %x\n", static_cast<int>(diag_state::dumping));
         if (pthread_create(&logging_thread_handle, nullptr, diag_logging_thread, nullptr) != 0) {
           KLOGE("%s: logging_thread_handle thread: init err\n", "process_message");
-          set_diag_logging_state(1);
+          set_diag_logging_state(diag_state::logging);
         } else {
           KLOGI("%s: logging_thread_handle success \n", "process_message");
         }
-        KLOGE("diag : To stop logging %x\n", diag_logging_state());
+        KLOGE("diag : To stop logging %x\n", static_cast<int>(diag_logging_state()));
       }
     }
   }

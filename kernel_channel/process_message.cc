@@ -30,11 +30,14 @@ constexpr uint32_t kWithArgument = kArgumentOffset + 4;
 constexpr uint32_t kWithCoefficients = kCoefficientsOffset + 8 * 4;
 
 constexpr command_entry kNone = {nullptr, kFrameHeaderSize, nullptr};
+// Every command of the bulk-data family (is_bigdata_command) runs this one; their rows in
+// kCommands are empty.
 constexpr command_entry kBigdata = {"NETLINK_MESSAGE_BIGDATA", kWithArgument,
                                     [](const uint8_t* f) { send_bigdata(f); }};
 
 constexpr command_entry kCommands[kLastCommand + 1] = {
-    /* 0 */ {"NETLINK_MESSAGE_GET_STATUS", kWithSensorType, [](const uint8_t* f) { get_status(f); }},
+    /* 0 */ {"NETLINK_MESSAGE_GET_STATUS", kWithSensorType,
+             [](const uint8_t* f) { get_status(f); }},
     /* 1 */
     {"NETLINK_MESSAGE_GET_RAW_DATA", kWithSensorType, [](const uint8_t* f) { get_raw_data(f); }},
     /* 2 */ kNone,
@@ -79,17 +82,17 @@ constexpr command_entry kCommands[kLastCommand + 1] = {
     /* 19 */ {"NETLINK_MESSAGE_DUMP_REGISTER", kWithSensorType, &run_dump_register_command},
     /* 20 */ kNone,
     /* 21 */ kNone,
-    /* 22 */ kBigdata,
-    /* 23 */ kBigdata,
-    /* 24 */ kBigdata,
-    /* 25 */ kBigdata,
-    /* 26 */ kBigdata,
+    /* 22 */ kNone,
+    /* 23 */ kNone,
+    /* 24 */ kNone,
+    /* 25 */ kNone,
+    /* 26 */ kNone,
     /* 27 */ {"NETLINK_MESSAGE_DIAG_LOGGING", kWithArgument, &run_diag_logging_command},
-    /* 28 */ kBigdata,
-    /* 29 */ kBigdata,
+    /* 28 */ kNone,
+    /* 29 */ kNone,
     /* 30 */ kNone,
-    /* 31 */ kBigdata,
-    /* 32 */ kBigdata,
+    /* 31 */ kNone,
+    /* 32 */ kNone,
     /* 33 */ kNone,
     /* 34 */ kNone,
     /* 35 */
@@ -100,16 +103,14 @@ constexpr command_entry kCommands[kLastCommand + 1] = {
      [](const uint8_t*) { run_hh_file_permissions_command(); }},
 };
 
+// The entry of a command number, null when the number has no action.
+const command_entry* command_entry_of(uint16_t command) {
+  if (is_bigdata_command(command)) return &kBigdata;
+  if (command > kLastCommand || kCommands[command].run == nullptr) return nullptr;
+  return &kCommands[command];
+}
+
 }  // namespace
-
-const char* command_name(uint32_t command) {
-  return command <= static_cast<uint32_t>(kLastCommand) ? kCommands[command].name : nullptr;
-}
-
-uint32_t command_min_frame_length(uint32_t command) {
-  return command <= static_cast<uint32_t>(kLastCommand) ? kCommands[command].min_frame_length
-                                                        : kFrameHeaderSize;
-}
 
 int process_message(const uint8_t* buffer, int32_t count) {
   // The netlink walk (NLMSG_OK / NLMSG_NEXT), with each header copied out of the buffer so its
@@ -128,13 +129,12 @@ int process_message(const uint8_t* buffer, int32_t count) {
     }
     const uint16_t command = hdr.nlmsg_type;
     KLOGI("%s: %d", "process_message", command);
-    if (command <= kLastCommand && kCommands[command].run != nullptr) {
-      const command_entry& entry = kCommands[command];
-      if (hdr.nlmsg_len < entry.min_frame_length) {
-        KLOGE("%s: %s refused: frame of %u bytes, needs %u", "process_message", entry.name,
-              hdr.nlmsg_len, entry.min_frame_length);
+    if (const command_entry* entry = command_entry_of(command)) {
+      if (hdr.nlmsg_len < entry->min_frame_length) {
+        KLOGE("%s: %s refused: frame of %u bytes, needs %u", "process_message", entry->name,
+              hdr.nlmsg_len, entry->min_frame_length);
       } else {
-        entry.run(frame);
+        entry->run(frame);
       }
     }
     const uint32_t step = NLMSG_ALIGN(hdr.nlmsg_len);

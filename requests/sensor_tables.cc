@@ -44,10 +44,6 @@ int32_t pdata_sensor_type(int32_t smgr_id) {
   }
 }
 
-int32_t pdata_sensor_type_of(int32_t sensor_type) {
-  return pdata_sensor_type(smgr_id_by_sensor_type(sensor_type));
-}
-
 bool getUUID(uint32_t sensor_type, uint8_t* suid) {
   const uint8_t* source = nullptr;
   switch (sensor_type) {

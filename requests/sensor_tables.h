@@ -11,9 +11,6 @@ int32_t smgr_id_by_sensor_type(int32_t sensor_type, int32_t out_of_range = -1);
 // Kernel reply code of a sensor-manager id: 0, 1, 2, 3, 5, 6 or -1.
 int32_t pdata_sensor_type(int32_t smgr_id);
 
-// pdata_sensor_type of the sensor-manager id of a sensor_type (-1 out of range).
-int32_t pdata_sensor_type_of(int32_t sensor_type);
-
 extern const uint8_t light_sensor_suid[16];
 extern const uint8_t accel_suid[16];
 extern const uint8_t mag_suid[16];

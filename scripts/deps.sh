@@ -1,7 +1,7 @@
 #!/usr/bin/env bash
 # Makes sure the Debian packages a target needs are installed: installs them with apt-get when
 # run as root, and otherwise says exactly what to install.
-#   scripts/deps.sh base|fuzz|soak|arm64
+#   scripts/deps.sh base|fuzz|soak|arm64|vm
 set -euo pipefail
 
 # libpcap writes and reads kestrelctl's captures, gnuplot draws its plots; tshark (with
@@ -29,7 +29,16 @@ case "${1:-base}" in
       fi
     fi
     ;;
-  *) echo "usage: $0 base|fuzz|soak|arm64" >&2; exit 2 ;;
+  vm)
+    # A kernel to boot with the headers to build the module against (the same version: the
+    # metapackages), the emulator, busybox for the VM's userland, sparse for the module's check
+    # and cpio for the initramfs. ARCH picks the kernel and emulator (scripts/vm/arch.sh).
+    case "${ARCH:-x86_64}" in
+      x86_64) packages+=(linux-image-amd64 linux-headers-amd64 qemu-system-x86) ;;
+    esac
+    packages+=(busybox-static sparse cpio make)
+    ;;
+  *) echo "usage: $0 base|fuzz|soak|arm64|vm" >&2; exit 2 ;;
 esac
 
 if ! command -v dpkg-query >/dev/null 2>&1; then

@@ -235,7 +235,7 @@ void handle_daf_indication(const uint8_t* body) {
 // The debug-level decision of boot, made again once the link is back.
 void restart_diag_logging() {
   if (check_loglevel()) {
-    set_diag_logging_state(0);
+    set_diag_logging_state(diag_state::stopped);
   } else {
     sns_set_diag_tx_mode();
   }
@@ -284,8 +284,8 @@ void handle_indication(const sensor1_msg_header_s& hdr, const uint8_t* body, uin
 void handle_broken_pipe() {
   begin_link_recovery();
   KLOGE("BROKEN_PIPE sensor1_handle %p\n", static_cast<void*>(current_sensor1_handle()));
-  if (diag_logging_state() != 0) {
-    set_diag_logging_state(0);
+  if (diag_logging_state() != diag_state::stopped) {
+    set_diag_logging_state(diag_state::stopped);
     run_shell_command(kDiagMdlogStop);
   }
   platform_sleep_milliseconds(50);

@@ -1,5 +1,6 @@
 #include "host_env.h"
 
+#include <linux/netlink.h>
 #include <stdlib.h>
 #include <string.h>
 
@@ -28,6 +29,7 @@ double env_scale() {
 
 host_env read_environment() {
   host_env e;
+  e.netlink_protocol = static_cast<int>(env_long("KESTREL_NETLINK_PROTOCOL", NETLINK_USERSOCK));
   e.kernel_port = static_cast<uint32_t>(env_long("KESTREL_KERNEL_PORT", 100));
   e.sensor1_socket = env_or("KESTREL_SENSOR1_SOCKET", "/tmp/kestrel-sensor1.sock");
   e.properties = env_or("KESTREL_PROPERTIES", nullptr);

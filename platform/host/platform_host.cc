@@ -1,23 +1,25 @@
-// Host side of the platform interface: netlink protocol NETLINK_USERSOCK, the kernel played by
-// whoever binds KESTREL_KERNEL_PORT, paths under KESTREL_SYSROOT and delays scaled by
-// KESTREL_TIME_SCALE.
-#include <linux/netlink.h>
+// Host side of the platform interface: netlink protocol KESTREL_NETLINK_PROTOCOL (NETLINK_USERSOCK
+// unless set), the kernel played by whoever binds KESTREL_KERNEL_PORT, paths under KESTREL_SYSROOT
+// and delays scaled by KESTREL_TIME_SCALE.
+//
+// With KESTREL_NETLINK_PROTOCOL=23 and KESTREL_KERNEL_PORT=0 the daemon talks to the factory
+// driver module as the phone's build does. Under qemu-user, which refuses every netlink protocol
+// it has no translation for, NETLINK_USERSOCK among them, the arm64 tests set it to
+// NETLINK_KOBJECT_UEVENT (15), which the emulator passes through untouched. The frames are the
+// same bytes whichever protocol carries them.
 #include <stdio.h>
 #include <time.h>
 
 #include "host_env.h"
 #include "kestrel_platform.h"
 
-// A build run under qemu-user sets KESTREL_HOST_NETLINK_PROTOCOL to NETLINK_KOBJECT_UEVENT: the
-// emulator refuses every netlink protocol it has no translation for, NETLINK_USERSOCK among them,
-// and passes that one through untouched. The frames are the same bytes either way.
-#ifndef KESTREL_HOST_NETLINK_PROTOCOL
-#define KESTREL_HOST_NETLINK_PROTOCOL NETLINK_USERSOCK
-#endif
+int platform_netlink_protocol(void) {
+  return host_environment().netlink_protocol;
+}
 
-int platform_netlink_protocol(void) { return KESTREL_HOST_NETLINK_PROTOCOL; }
-
-uint32_t platform_kernel_port_id(void) { return host_environment().kernel_port; }
+uint32_t platform_kernel_port_id(void) {
+  return host_environment().kernel_port;
+}
 
 const char* platform_path(const char* path, char* buf, size_t size) {
   snprintf(buf, size, "%s%s", host_environment().sysroot, path);

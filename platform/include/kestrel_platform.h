@@ -6,7 +6,8 @@
 #include <stddef.h>
 #include <stdint.h>
 
-// Netlink protocol of the kernel factory driver: 23 on the phone, NETLINK_USERSOCK on the host.
+// Netlink protocol of the kernel factory driver: 23 on the phone, KESTREL_NETLINK_PROTOCOL on the
+// host (NETLINK_USERSOCK unless set).
 int platform_netlink_protocol(void);
 
 // Port id the daemon sends its frames to: 0 (the kernel) on the phone.

@@ -1,5 +1,5 @@
 #!/usr/bin/env bash
-# Checks android/Android.bp the way a device tree will read it:
+# Checks Android.bp the way a device tree will read it:
 #   - bpfmt parses it, and it is formatted as bpfmt formats it;
 #   - every file it names exists in the repository;
 #   - libkestreld_core compiles the daemon sources of CMake's kestreld_core, plus the phone's
@@ -9,7 +9,7 @@ set -euo pipefail
 
 bpfmt=$1
 root=$2
-bp=android/Android.bp
+bp=Android.bp
 cd "$root"
 failed=0
 

@@ -58,7 +58,7 @@ class DiagTest : public DaemonFixture {
     setenv("PATH", (t.dir() + ":" + path).c_str(), 1);
   }
   // The dump thread sets the state last, right before it ends.
-  static bool wait_for_state(int32_t value) {
+  static bool wait_for_state(diag_state value) {
     return eventually([=] { return diag_logging_state() == value; }, 20000ms);
   }
 

@@ -25,35 +25,35 @@ TEST_F(DiagTest, StopDuringDumpEndsItWithoutRestart) {
                  "done\n");
   ASSERT_EQ(chmod((dir + "/diag_mdlog").c_str(), 0755), 0);
   ASSERT_EQ(mkdir((dir + "/hold").c_str(), 0755), 0);
-  set_diag_logging_state(1);
+  set_diag_logging_state(diag_state::logging);
 
   command(27, {0, 0});
   ASSERT_TRUE(tools.wait_for_calls(1, 5000));
   // The dump thread is inside its stop command: mode 0 set, nothing checked yet.
   const Lines at_stop = Lines{"I diag_logging_thread start\n"} + mode_lines(0);
   EXPECT_EQ(view(log->records()), at_stop);
-  EXPECT_EQ(diag_logging_state(), 3);
+  EXPECT_EQ(diag_logging_state(), diag_state::dumping);
 
   command(27, {0, 1});
-  EXPECT_EQ(diag_logging_state(), 0);
+  EXPECT_EQ(diag_logging_state(), diag_state::stopped);
   write_file(dir + "/release", "");
 
   // After its pause the dump finds logging stopped and starts nothing.
   EXPECT_FALSE(log->wait_for("check_property Success\n", scaled(20000ms)));
   EXPECT_EQ(view(log->records()), at_stop);
-  EXPECT_EQ(diag_logging_state(), 0);
+  EXPECT_EQ(diag_logging_state(), diag_state::stopped);
   EXPECT_EQ(tools.calls(), (Lines{kStop, kStop}));
 }
 
 TEST_F(DiagTest, DumpsAskedForWhileOneRunsNeverOverlap) {
-  set_diag_logging_state(1);
+  set_diag_logging_state(diag_state::logging);
   size_t commands = 0;
   while (log->count("diag : To start logging 3\n") < 3 && commands < 2000) {
     command(27, {0, 0});
     ++commands;
     std::this_thread::sleep_for(2ms);
   }
-  ASSERT_TRUE(wait_for_state(1));
+  ASSERT_TRUE(wait_for_state(diag_state::logging));
 
   // Every command found logging either idle (and started a dump) or a dump running.
   EXPECT_EQ(log->count("diag : To start logging 3\n"), 3u);

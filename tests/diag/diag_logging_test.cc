@@ -55,14 +55,14 @@ TEST_F(DiagTest, UsbConfigAndUartFileDecideWhetherLoggingStarts) {
     } else if (c.uart != nullptr) {
       write_file(uart_path(), c.uart);
     }
-    set_diag_logging_state(3);
+    set_diag_logging_state(diag_state::dumping);
     log->clear();
 
     sns_set_diag_tx_mode();
 
     EXPECT_EQ(view(log->records()), c.expected);
     const bool started = c.expected.back() == kStarted.back();
-    EXPECT_EQ(diag_logging_state(), started ? 1 : 0);
+    EXPECT_EQ(diag_logging_state(), started ? diag_state::logging : diag_state::stopped);
     EXPECT_TRUE(!started || case_tools.wait_for_calls(1, 5000));
     EXPECT_EQ(case_tools.calls(), started ? Lines{kStart} : Lines{});
   }
@@ -71,12 +71,12 @@ TEST_F(DiagTest, UsbConfigAndUartFileDecideWhetherLoggingStarts) {
 
 TEST_F(DiagTest, DebugLevelEndsStartThreadBeforeTheServiceIsOpened) {
   write_file(test_properties_path(), "ro.debug_level=0x4f4c\n");
-  set_diag_logging_state(1);
+  set_diag_logging_state(diag_state::logging);
   std::thread(diag_logging_start_thread, nullptr).join();
 
   EXPECT_EQ(view(log->records()),
             (Lines{"I diag_logging_start_thread start\n", "I check_loglevel stop logging\n"}));
-  EXPECT_EQ(diag_logging_state(), 0);
+  EXPECT_EQ(diag_logging_state(), diag_state::stopped);
   EXPECT_EQ(open_retry_budget(), kOpenRetryBudget);
   EXPECT_EQ(sim->opened_connections(), 0);
   EXPECT_TRUE(tools.calls().empty());
@@ -92,13 +92,13 @@ TEST_F(DiagTest, StartThreadOpensTheServiceThenStartsLogging) {
       (Lines{"I diag_logging_start_thread start\n",
              "I sensor1_open_or_reopen: sensor1_open success\n"} +
        kChecksPass + kStarted));
-  EXPECT_EQ(diag_logging_state(), 1);
+  EXPECT_EQ(diag_logging_state(), diag_state::logging);
   ASSERT_TRUE(tools.wait_for_calls(1, 5000));
   EXPECT_EQ(tools.calls(), Lines{kStart});
 }
 
 TEST_F(DiagTest, DumpStopsAndRestartsLogging) {
-  set_diag_logging_state(1);
+  set_diag_logging_state(diag_state::logging);
   command(27, {0, 0});
 
   // The dispatcher's own lines; the dump thread's are checked below.
@@ -114,7 +114,7 @@ TEST_F(DiagTest, DumpStopsAndRestartsLogging) {
   ASSERT_FALSE(at_checks.empty());
   EXPECT_EQ(at_checks[0], kStop);
 
-  ASSERT_TRUE(wait_for_state(1));
+  ASSERT_TRUE(wait_for_state(diag_state::logging));
   EXPECT_EQ(view(log->records()),
             Lines{"I diag_logging_thread start\n"} + mode_lines(0) + kChecksPass + kStarted);
   ASSERT_TRUE(tools.wait_for_calls(2, 5000));

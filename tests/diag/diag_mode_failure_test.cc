@@ -18,9 +18,9 @@ Lines refused_mode(int mode) {
           "I libdiag: Diag_LSM_DeInit"};
 }
 
-TEST_F(DiagTest, ADumpWhoseModesAreRefusedLeavesTheStateAtThree) {
+TEST_F(DiagTest, ADumpWhoseModesAreRefusedLeavesTheStateDumping) {
   ASSERT_EQ(kModesRefused, 0);
-  set_diag_logging_state(1);
+  set_diag_logging_state(diag_state::logging);
   command(27, {0, 0});
   ASSERT_TRUE(log->wait_for("sns_set_diag_tx_mode: sns_set_diag_mode result: 0\n", 5000ms));
   EXPECT_EQ(view(log->records()),
@@ -28,7 +28,7 @@ TEST_F(DiagTest, ADumpWhoseModesAreRefusedLeavesTheStateAtThree) {
                 Lines{"E send_dumpstate: sns_set_diag_mode result: 0\n"} + kChecksPass +
                 refused_mode(2) + Lines{"E sns_set_diag_tx_mode: sns_set_diag_mode result: 0\n"});
   EXPECT_EQ(tools.calls(), Lines{kStop});
-  EXPECT_EQ(diag_logging_state(), 3);
+  EXPECT_EQ(diag_logging_state(), diag_state::dumping);
   log->clear();
   command(27, {0, 0});
   EXPECT_TRUE(log->wait_for("diag : Logging System is running\n", 1000ms));

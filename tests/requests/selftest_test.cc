@@ -120,7 +120,7 @@ TEST_F(SelftestTest, ALateIndicationIsTakenByTheNextWait) {
   // test waits for the flag too.
   sim->indicate(Header{0, 13, 0, 4}, kestrel_sim::test_indication_body(30, 6, 0, 0, 0, {5, 200}));
   ASSERT_TRUE(log->wait_for("rcv_complete: result - 0\n", 2000ms));
-  eventually(command_waiter_arrived_for_testing, 2000ms);
+  ASSERT_TRUE(eventually(command_waiter_arrived_for_testing, 2000ms));
   command(8, {3});
   EXPECT_EQ(frame(9), word_frame(9, {3, 5, 2}, 18));
   EXPECT_THAT(last_lines(3), ElementsAre("waiting for response IN - timeout=8000",

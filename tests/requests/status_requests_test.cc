@@ -34,7 +34,5 @@ TEST_F(StatusTest, StatusReplyTellsWhetherATestIndicationWasHandedOver) {
   EXPECT_THAT(main_lines(), ElementsAre("process_message: 27"));
 }
 
-using RequestPatternTest = RequestTest;
-
 }  // namespace
 }  // namespace request_test

@@ -93,7 +93,7 @@ TEST_F(CallbackThreadsTest, DroppedLinkIsReopenedAndLoggingRestartedAsTheDebugLe
   for (const auto& [level_stops, main_opens] : cases) {
     write_file(test_properties_path(),
                level_stops ? "ro.debug_level=0x4f4c" : "ro.debug_level=0x494d");
-    set_diag_logging_state(1);
+    set_diag_logging_state(diag_state::logging);
     log->clear();
     sim->hold_opens(500ms, main_opens ? 1 : 0);
     sim->drop_connection();
@@ -114,7 +114,7 @@ TEST_F(CallbackThreadsTest, DroppedLinkIsReopenedAndLoggingRestartedAsTheDebugLe
     expected.insert(expected.end(), diag.begin(), diag.end());
     expected.insert(expected.end(), {kRefresh, kLastLine});
     EXPECT_THAT(recovery_lines(), ElementsAreArray(expected));
-    EXPECT_EQ(diag_logging_state(), level_stops ? 0 : 1);
+    EXPECT_EQ(diag_logging_state(), level_stops ? diag_state::stopped : diag_state::logging);
     ASSERT_TRUE(tools.wait_for_calls(main_opens ? 5 : level_stops ? 3 : 2, 5000));
     handle = current_sensor1_handle();
   }
@@ -160,7 +160,7 @@ TEST_F(CallbackThreadsTest, BrokenLinkWhileACommandWaitsThenResultsReachTheWaiti
 TEST_F(CallbackThreadsTest, WriteFailureDuringARecoveryLeavesTheCloseToIt) {
   get_handle_for_sensor(0);
   ToolGate gate(tools);
-  set_diag_logging_state(1);
+  set_diag_logging_state(diag_state::logging);
   ASSERT_TRUE(sim->fault(FaultOp::kWrite, 5, 1));
   sim->callback(250, true, false, Header{}, {});
   ASSERT_TRUE(tools.wait_for_calls(1, 5000));

@@ -30,7 +30,7 @@ void DaemonFixture::SetUp() {
   reset_response_waiters_for_testing();
   reset_factory_state_for_testing();
   reset_raw_data_flags_for_testing();
-  set_diag_logging_state(0);
+  set_diag_logging_state(diag_state::stopped);
   set_netmgr_malloc_for_testing(nullptr);
   stale_calls_at_setup = sensor1_host_stale_handle_calls();
   log->clear();

@@ -115,7 +115,7 @@ bool DaemonProcess::wait_for(const std::string& message, std::chrono::millisecon
 }
 
 std::optional<int> DaemonProcess::wait_exit(std::chrono::milliseconds timeout) {
-  eventually(
+  const bool ended = eventually(
       [&] {
         int status = 0;
         if (!status_ && waitpid(pid_, &status, WNOHANG) == pid_) {
@@ -124,5 +124,5 @@ std::optional<int> DaemonProcess::wait_exit(std::chrono::milliseconds timeout) {
         return status_.has_value();
       },
       timeout);
-  return status_;
+  return ended ? status_ : std::nullopt;
 }

@@ -20,8 +20,8 @@ std::chrono::milliseconds scaled(std::chrono::milliseconds nominal);
 
 // Polls done every 2 ms until it holds (true) or timeout has passed (false); done runs at least
 // once.
-bool eventually(const std::function<bool()>& done,
-                std::chrono::milliseconds timeout = std::chrono::seconds(5));
+[[nodiscard]] bool eventually(const std::function<bool()>& done,
+                              std::chrono::milliseconds timeout = std::chrono::seconds(5));
 
 // Writes a whole file (the parent directories are created).
 void write_file(const std::string& path, const std::string& text);

@@ -1,6 +1,7 @@
 #include "kernel_port.h"
 
 #include <errno.h>
+#include <fcntl.h>
 #include <linux/netlink.h>
 #include <poll.h>
 #include <stdlib.h>
@@ -15,14 +16,15 @@
 namespace kestrelctl {
 
 uint32_t kernel_port_from_environment() {
-  const char* v = getenv("KESTREL_KERNEL_PORT");
-  if (v == nullptr || v[0] == '\0') return 100;
-  char* end = nullptr;
-  const long n = strtol(v, &end, 0);
-  return (end != v && *end == '\0') ? static_cast<uint32_t>(n) : 100;
+  return platform_kernel_port_id();
 }
 
 namespace {
+
+std::string& device_path() {
+  static std::string path;
+  return path;
+}
 
 bool fail(std::string* error, const std::string& message) {
   if (error != nullptr) *error = message;
@@ -40,11 +42,24 @@ bool KernelPort::open_socket(std::string* error) {
   return fd_ >= 0 || fail(error, std::string("cannot open a netlink socket: ") + strerror(errno));
 }
 
+void KernelPort::use_device(const std::string& path) {
+  device_path() = path;
+}
+
+bool KernelPort::open_device(int flags, std::string* error) {
+  device_ = true;
+  fd_ = open(device_path().c_str(), flags | O_CLOEXEC);
+  return fd_ >= 0 ||
+         fail(error, "cannot open " + device_path() + ": " + strerror(errno) +
+                         (errno == ENOENT ? " (is the kestrel_factory module loaded?)" : ""));
+}
+
 bool KernelPort::open_unbound(std::string* error) {
-  return open_socket(error);
+  return device_path().empty() ? open_socket(error) : open_device(O_WRONLY, error);
 }
 
 bool KernelPort::open_bound(uint32_t port, std::string* error) {
+  if (!device_path().empty()) return open_device(O_RDWR, error);
   if (!open_socket(error)) return false;
   // Samples come fast; a larger queue keeps a slow reader from losing them (beyond the system's
   // limit where the process may raise it).
@@ -74,12 +89,16 @@ bool KernelPort::send(const std::vector<uint8_t>& datagram, std::string* error) 
 }
 
 bool KernelPort::send_to(uint32_t port, const std::vector<uint8_t>& datagram, std::string* error) {
+  if (device_ && port != kDaemonPortId) {
+    return fail(error, "the factory driver's device sends only to the daemon's port id");
+  }
   struct sockaddr_nl addr;
   memset(&addr, 0, sizeof addr);
   addr.nl_family = AF_NETLINK;
   addr.nl_pid = port;
-  const ssize_t n = sendto(fd_, datagram.data(), datagram.size(), 0,
-                           reinterpret_cast<struct sockaddr*>(&addr), sizeof addr);
+  const ssize_t n = device_ ? write(fd_, datagram.data(), datagram.size())
+                            : sendto(fd_, datagram.data(), datagram.size(), 0,
+                                     reinterpret_cast<struct sockaddr*>(&addr), sizeof addr);
   if (n == static_cast<ssize_t>(datagram.size())) {
     if (capture_ != nullptr) {
       struct timeval now;
@@ -109,8 +128,11 @@ KernelPort::Wait KernelPort::read_datagram(int timeout_ms, std::string* error) {
   struct sockaddr_nl from;
   socklen_t from_len = sizeof from;
   memset(&from, 0, sizeof from);
-  const ssize_t n =
-      recvfrom(fd_, buf, sizeof buf, 0, reinterpret_cast<struct sockaddr*>(&from), &from_len);
+  // The device hands over what the daemon sent to port id 0, one datagram a read.
+  from.nl_pid = kDaemonPortId;
+  const ssize_t n = device_ ? read(fd_, buf, sizeof buf)
+                            : recvfrom(fd_, buf, sizeof buf, 0,
+                                       reinterpret_cast<struct sockaddr*>(&from), &from_len);
   if (n < 0) {
     if (errno == EINTR) return Wait::kInterrupted;
     if (errno == ENOBUFS) return Wait::kOverrun;

@@ -46,7 +46,8 @@ const char kHelp[] =
 daemon (netlink port 20000) and prints, decoded, the frames the daemon sends to the kernel's
 port (KESTREL_KERNEL_PORT, default 100).
 
-Usage: kestrelctl [--json] [--quiet] [--timeout SEC] [--pcap FILE] <command> [arguments]
+Usage: kestrelctl [--json] [--quiet] [--timeout SEC] [--pcap FILE] [--kernel-device PATH]
+                  <command> [arguments]
 
 Commands that wait for their reply (exit status 1 when it does not come in time):
   status <sensor>                 command 0; reply frame 0 (did the sensor answer)
@@ -105,6 +106,8 @@ Options:
                  capture of netlink protocol 23 (link type NETLINK, as tcpdump writes on
                  nlmon) that tshark and Wireshark open (tools/wireshark/ decodes its fields).
                  An existing capture is appended to, so a session's commands share a file.
+  --kernel-device PATH  talk through the factory driver module's device (/dev/kestrel_factory)
+                 to a daemon run with KESTREL_NETLINK_PROTOCOL=23 KESTREL_KERNEL_PORT=0
   --csv FILE     the samples of the stream (or of the capture) as CSV: time_s from the first
                  sample, then one column an axis in physical units (x_g, y_g, z_g)
   --plot FILE    the same drawn by gnuplot, PNG or SVG by the file's extension
@@ -233,6 +236,8 @@ Options parse_options(int argc, char** argv) {
       o.count = n;
     } else if (name == "--pcap") {
       o.pcap = take_value();
+    } else if (name == "--kernel-device") {
+      KernelPort::use_device(take_value());
     } else if (name == "--csv") {
       o.csv = take_value();
     } else if (name == "--plot") {

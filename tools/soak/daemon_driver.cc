@@ -16,6 +16,7 @@
 #include <thread>
 
 #include "frame_codec.h"
+#include "kernel_frame.h"
 
 extern char** environ;
 
@@ -107,12 +108,10 @@ std::vector<Planned> cycle(long c) {
       {build_command(18), -1},
       {build_command(19, {static_cast<int32_t>(c % 6)}), 20},
   };
-  for (uint16_t bulk : {22, 23, 24, 25, 26}) out.push_back({build_bigdata(bulk, 4, data), -1});
   out.push_back({build_command(27, {0, 2}), -1});
-  out.push_back({build_bigdata(28, 4, data), 30});
-  out.push_back({build_bigdata(29, 4, data), 30});
-  out.push_back({build_bigdata(31, 4, data), 33});
-  out.push_back({build_bigdata(32, 4, data), 33});
+  for (const bigdata_kind& kind : kBigdataKinds) {
+    out.push_back({build_bigdata(kind.command, 4, data), kind.reply_frame});
+  }
   out.push_back({kestrelctl::build_hidden_hole({1, 2, 3, 4, 5, 6, 7, 8, 9}), -1});
   if (c % 10 == 9) out.push_back({build_command(36), -1});
   return out;
