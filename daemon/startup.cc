@@ -42,7 +42,7 @@ void single_instance_guard() {
 void* hh_read_data_thread(void*) {
   KLOGI("%s start\n", "hh_read_data_thread");
   platform_sleep_seconds(10);
-  const uint8_t payload[2] = {260 & 0xff, 260 >> 8};
+  const uint8_t payload[kHhRefreshPayloadSize] = {kHhRefreshValue & 0xff, kHhRefreshValue >> 8};
   send_to_kernel(FRAME_HH_REFRESH, payload, sizeof payload);
   return nullptr;
 }

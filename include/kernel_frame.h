@@ -178,3 +178,40 @@ struct threshold_reply_frame {  // frame types 30 and 33
   int32_t hd_low;
 };
 static_assert(sizeof(threshold_reply_frame) == 16, "");
+
+// The hidden-hole refresh (frame type 34) carries one u16, 260.
+constexpr uint32_t kHhRefreshPayloadSize = 2;
+constexpr uint16_t kHhRefreshValue = 260;
+
+// Every outbound frame type, with the payload its record fills and its name in the tools.
+struct outbound_frame {
+  kernel_frame_type type;
+  uint32_t payload_size;
+  const char* name;
+};
+constexpr outbound_frame kOutboundFrames[] = {
+    {FRAME_STATUS, sizeof(status_reply), "status"},
+    {FRAME_SAMPLE, sizeof(sample_frame), "sample"},
+    {FRAME_STOP_RAW_DATA, sizeof(stop_reply), "stop"},
+    {FRAME_CALIBRATION_REPORT, sizeof(calibration_report), "calibration_report"},
+    {FRAME_STORE_CALIBRATION, sizeof(store_calib_reply), "store_calibration"},
+    {FRAME_SELFTEST, sizeof(selftest_reply), "selftest"},
+    {FRAME_GYRO_TEMPERATURE, sizeof(gyro_reply), "gyro_temperature"},
+    {FRAME_MAG_FUSE_ROM, sizeof(mag_reply), "mag_fuse_rom"},
+    {FRAME_MAG_REGISTERS, sizeof(mag_reply), "mag_registers"},
+    {FRAME_GYRO_SELFTEST, sizeof(gyro_reply), "gyro_selftest"},
+    {FRAME_ACCEL_LPF_ON, sizeof(lpf_result), "lpf_on"},
+    {FRAME_ACCEL_LPF_OFF, sizeof(lpf_result), "lpf_off"},
+    {FRAME_REGISTER_DUMP, sizeof(register_dump_frame), "register_dump"},
+    {FRAME_THRESHOLD, sizeof(threshold_reply_frame), "threshold"},
+    {FRAME_HD_THRESHOLD, sizeof(threshold_reply_frame), "hd_threshold"},
+    {FRAME_HH_REFRESH, kHhRefreshPayloadSize, "hh_refresh"},
+};
+
+// The outbound frame of a type, null for the types the daemon never sends.
+constexpr const outbound_frame* outbound_frame_of(uint32_t type) {
+  for (const outbound_frame& f : kOutboundFrames) {
+    if (f.type == type) return &f;
+  }
+  return nullptr;
+}

@@ -38,7 +38,7 @@ bool mag_sensitivity_initialized = false;
 bool mag_cal_reset_done = false;
 
 bool is_light_sensor_type(int32_t sensor_type) {
-  return sensor_type == 4 || sensor_type == 5;
+  return sensor_type == SENSOR_TYPE_LIGHT || sensor_type == SENSOR_TYPE_LIGHT_SHORT;
 }
 
 uint8_t report_id(int32_t smgr_id) {
@@ -126,7 +126,8 @@ int get_raw_data(const uint8_t* frame) {
   const int32_t smgr_id = smgr_id_by_sensor_type(sensor_type);
   sensor1_request req;
   if (is_light_sensor_type(sensor_type)) {
-    const uint32_t id = sensor_type == 4 ? kDafLightStreamStart : kDafLightShortStart;
+    const uint32_t id =
+        sensor_type == SENSOR_TYPE_LIGHT ? kDafLightStreamStart : kDafLightShortStart;
     if (!send_light_request(&req, name, sensor_type, id, kLightStreamData)) return -1;
   } else {
     if (!begin_report_request(&req, name, sensor_type)) return -1;
@@ -155,7 +156,7 @@ int stop_raw_data(const uint8_t* frame) {
   const int32_t smgr_id = smgr_id_by_sensor_type(sensor_type);
   sensor1_request req;
   if (is_light_sensor_type(sensor_type)) {
-    const uint32_t id = sensor_type == 4 ? kDafLightStreamStop : kDafLightShortStop;
+    const uint32_t id = sensor_type == SENSOR_TYPE_LIGHT ? kDafLightStreamStop : kDafLightShortStop;
     if (!send_light_request(&req, name, sensor_type, id, kLightStopData)) return -1;
   } else {
     if (!begin_report_request(&req, name, sensor_type)) return -1;

@@ -28,8 +28,6 @@ constexpr uint32_t kTestTypeLpfOff = 12;
 constexpr int32_t kMotorEnabled = 14;
 constexpr int32_t kMotorDisabled = 15;
 
-constexpr uint32_t kLastDumpSensorType = 5;
-
 // The fuse-ROM value of an axis scales its samples by value / 128 + 1.
 float sensitivity_of(int32_t fuse_rom) {
   return static_cast<float>(fuse_rom) * 0.0078125f + 1.0f;

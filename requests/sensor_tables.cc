@@ -4,13 +4,6 @@
 
 #include "kestrel_log.h"
 
-namespace {
-
-constexpr int32_t kSmgrIdBySensorType[16] = {0,  10, 20, 30, 40, 40, 60, -1,
-                                             20, 20, -1, 10, 0,  0,  0,  0};
-
-}  // namespace
-
 const uint8_t light_sensor_suid[16] = {0x33, 0xfc, 0x91, 0xdc, 0xc8, 0x0c, 0x41, 0xf2,
                                        0xa3, 0xf2, 0xce, 0xd5, 0xe2, 0x9e, 0xb7, 0x8b};
 const uint8_t accel_suid[16] = {0x3c, 0xfd, 0x26, 0xe8, 0x52, 0xaf, 0x48, 0xbe,
@@ -19,30 +12,6 @@ const uint8_t mag_suid[16] = {0xf6, 0xae, 0x80, 0xfe, 0x94, 0x2b, 0x4d, 0x56,
                               0x8f, 0x16, 0x61, 0xd5, 0x98, 0x1b, 0x61, 0x90};
 const uint8_t pressure_suid[16] = {0x40, 0x50, 0xf5, 0x06, 0x32, 0x95, 0x11, 0xe6,
                                    0x8e, 0x99, 0x40, 0xa8, 0xf0, 0x5f, 0x17, 0xff};
-
-int32_t smgr_id_by_sensor_type(int32_t sensor_type, int32_t out_of_range) {
-  if (static_cast<uint32_t>(sensor_type) > 15) return out_of_range;
-  return kSmgrIdBySensorType[sensor_type];
-}
-
-int32_t pdata_sensor_type(int32_t smgr_id) {
-  switch (smgr_id) {
-    case 0:
-      return 0;
-    case 10:
-      return 1;
-    case 20:
-      return 2;
-    case 30:
-      return 3;
-    case 40:
-      return 5;
-    case 60:
-      return 6;
-    default:
-      return -1;
-  }
-}
 
 bool getUUID(uint32_t sensor_type, uint8_t* suid) {
   const uint8_t* source = nullptr;

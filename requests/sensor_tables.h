@@ -4,12 +4,8 @@
 
 #include <stdint.h>
 
-// Sensor-manager id of a sensor_type; out_of_range for anything outside 0..15 (tested as an
-// unsigned number, so negative values are out of range) and -1 for the types without one.
-int32_t smgr_id_by_sensor_type(int32_t sensor_type, int32_t out_of_range = -1);
-
-// Kernel reply code of a sensor-manager id: 0, 1, 2, 3, 5, 6 or -1.
-int32_t pdata_sensor_type(int32_t smgr_id);
+// smgr_id_by_sensor_type and pdata_sensor_type, shared with the tools.
+#include "kernel_sensors.h"
 
 extern const uint8_t light_sensor_suid[16];
 extern const uint8_t accel_suid[16];

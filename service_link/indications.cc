@@ -10,6 +10,7 @@
 #include "diag/diag_logging.h"
 #include "kernel_channel/netlink_channel.h"
 #include "kernel_frame.h"
+#include "kernel_sensors.h"
 #include "kestrel_log.h"
 #include "kestrel_platform.h"
 #include "sensor1_messages.h"
@@ -32,9 +33,6 @@ constexpr size_t kMagFuseRomWord = 14;
 // Data lengths a DAF indication must announce before its words are taken.
 constexpr uint32_t kDafAlsRgbLength = 24;
 constexpr uint32_t kDafShortLength = 8;
-// Kernel sensor codes of the frames they fill.
-constexpr int32_t kCodeAlsRgb = 4;
-constexpr int32_t kCodeLightShort = 5;
 // The reopen after a broken link: three tries, a second apart.
 constexpr int kReopenTries = 3;
 
@@ -205,7 +203,7 @@ void handle_daf_indication(const uint8_t* body) {
     const uint8_t valid = load_u8(body, kDafIndValidOffset);
     const uint32_t length = load_u32(body, kDafIndLengthOffset);
     if (valid != 0 && length >= kDafAlsRgbLength) {
-      frame.code = kCodeAlsRgb;
+      frame.code = SENSOR_CODE_RAW;
       frame.value[0] = daf_value(body, 1);
       frame.value[1] = daf_value(body, 2);
       frame.value[2] = daf_value(body, 3);
@@ -221,7 +219,7 @@ void handle_daf_indication(const uint8_t* body) {
   } else if (code == kDafIndShort) {
     if (load_u8(body, kDafIndValidOffset) != 0 &&
         load_u32(body, kDafIndLengthOffset) >= kDafShortLength) {
-      frame.code = kCodeLightShort;
+      frame.code = SENSOR_CODE_LIGHT;
       frame.value[0] = daf_value(body, 0);
       frame.value[1] = daf_value(body, 1);
     } else {

@@ -2,6 +2,8 @@
 
 #include <cmath>
 
+#include "kernel_sensors.h"
+
 namespace {
 
 // 1/65536: the sensor manager's Q16 fixed point.
@@ -11,16 +13,6 @@ constexpr float kAccelScale = 417.67575f;
 // Gyroscope and magnetometer scales, in double precision.
 constexpr double kGyroScale = 0.06119849462134102;
 constexpr double kMagScale = 0.01017252595324357;
-
-// Kernel sensor codes of the sample frame.
-constexpr int32_t kCodeAccel = 0;
-constexpr int32_t kCodeGyro = 1;
-constexpr int32_t kCodeMag = 2;
-constexpr int32_t kCodePressure = 3;
-constexpr int32_t kCodeSecondary = 4;
-constexpr int32_t kCodeLight = 5;
-constexpr int32_t kCode60 = 6;
-constexpr int32_t kCodeUnknown = -1;
 
 // A(n): the product is taken in single precision and only then widened.
 double accel(int32_t n) {
@@ -61,44 +53,37 @@ void convert_sample(uint8_t sensor_id, uint8_t data_type, int32_t x, int32_t y, 
   *frame = sample_frame{};
   int16_t* v = frame->value;
   if (data_type == 1) {
-    frame->code = kCodeSecondary;
+    frame->code = SENSOR_CODE_RAW;
     v[0] = to_frame_value(q16(x));
     v[1] = to_frame_value(q16(y));
     v[2] = to_frame_value(q16(z));
     return;
   }
+  frame->code = pdata_sensor_type(sensor_id);
   // The accelerometer, gyroscope and magnetometer are mounted with x and y swapped and z
   // reversed against the kernel's axes.
   switch (sensor_id) {
-    case 0:
-      frame->code = kCodeAccel;
+    case kSmgrAccel:
       v[0] = to_frame_value(accel(y) * kQ16);
       v[1] = to_frame_value(accel(x) * kQ16);
       v[2] = to_frame_value(-(accel(z) * kQ16));
       break;
-    case 10:
-      frame->code = kCodeGyro;
+    case kSmgrGyro:
       v[0] = to_frame_value(static_cast<double>(y) * kGyroScale);
       v[1] = to_frame_value(static_cast<double>(x) * kGyroScale);
       v[2] = to_frame_value(-(static_cast<double>(z) * kGyroScale));
       break;
-    case 20:
+    case kSmgrMag:
       // Each axis by its own sensitivity; a sensitivity still 0 gives an infinite quotient,
       // which saturates (or 0/0, which gives 0).
-      frame->code = kCodeMag;
       v[0] = to_frame_value(mag(y) / static_cast<double>(sensitivity.y));
       v[1] = to_frame_value(mag(x) / static_cast<double>(sensitivity.x));
       v[2] = to_frame_value(-mag(z) / static_cast<double>(sensitivity.z));
       break;
-    case 30:
-      frame->code = kCodePressure;
-      break;
-    case 40:
-      frame->code = kCodeLight;
+    case kSmgrLight:
       v[0] = to_frame_value(1.0 + static_cast<double>(x) * -kQ16);
       break;
-    case 60:
-      frame->code = kCode60;
+    case kSmgrId60:
       v[0] = to_frame_value(q16(x));
       v[1] = to_frame_value(q16(y));
       v[2] = to_frame_value(q16(z));
@@ -106,8 +91,7 @@ void convert_sample(uint8_t sensor_id, uint8_t data_type, int32_t x, int32_t y, 
       v[4] = low_half(y);
       v[5] = low_half(z);
       break;
-    default:
-      frame->code = kCodeUnknown;
+    default:  // the pressure sensor and unknown ids: the code alone
       break;
   }
 }

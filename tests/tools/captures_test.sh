@@ -1,14 +1,16 @@
 #!/usr/bin/env bash
 # Captures end to end, on the demo's factory session: tshark with the dissector finds every frame
 # kestrelctl printed, with its length, and shows the fields `kestrelctl decode --json` prints;
-# decode skips other protocols' packets and stops at a cut packet or a cut file, naming it; the
-# stream's CSV holds the samples the daemon sent.
+# decode skips other protocols' packets and stops at a cut packet or a cut file, naming it, and
+# reads the session alike from the link types of tcpdump on any; live, it reads an interface until
+# --seconds or Ctrl-C and keeps what it saw; the stream's CSV holds the samples the daemon sent.
 #   captures_test.sh <build directory> <source directory>
 set -euo pipefail
 build=$1
 src=$2
 out=$(mktemp -d /tmp/kestrel-captures-XXXXXX)
-trap 'rm -rf "$out"' EXIT
+live=
+trap '[ -z "$live" ] || kill -KILL $(pgrep -P $live) $live 2>/dev/null; rm -rf "$out"' EXIT
 ctl=$build/tools/ctl/kestrelctl
 cap=$out/session.pcap
 failures=0
@@ -70,6 +72,59 @@ mergecap -F pcap -a -w "$out/phone.pcap" "$out/head.pcap" "$out/foreign.pcap" "$
 check "foreign packets skipped" diff "$out/session_text.txt" "$out/phone.txt"
 check "and counted" grep -qx "kestrelctl: $(wc -l < "$out/printed.txt") frames of netlink protocol \
 23; 2 packets of other protocols skipped" "$out/phone.err"
+
+# The session as tcpdump on any writes it, LINUX_SLL (the same header) and LINUX_SLL2 (20 bytes:
+# protocol, reserved, interface index, ARPHRD type, packet type, address length, address), with a
+# loopback packet first: decode prints the same frames at the same times and counts that one.
+relink() {  # link type, output file
+  command tshark -r "$cap" -T json -x 2>/dev/null |
+    jq -r '.[]._source.layers | [.frame["frame.time_epoch"], .frame_raw[0]] | @tsv' |
+    awk -F'\t' -v sll2=$(($1 == 276)) 'function emit(time, h,  i, j, line) {
+        if (sll2) h = substr(h, 29, 4) "000000000001" substr(h, 5, 4) substr(h, 3, 2) \
+          substr(h, 11, 2) substr(h, 13, 16) substr(h, 33)
+        print time
+        for (i = 1; i <= length(h); i += 32) { line = sprintf("%06x", (i - 1) / 2)
+          for (j = i; j < i + 32 && j <= length(h); j += 2) line = line " " substr(h, j, 2)
+          print line } }
+      NR == 1 { emit($1, "0000030400060000000000000000080045000014") }
+      { emit($1, $2) }' > "$out/relink.txt"
+  text2pcap -q -F pcap -t "%s.%f" -l "$1" "$out/relink.txt" "$2" 2>/dev/null
+}
+for link in 113:LINUX_SLL 276:LINUX_SLL2; do
+  relink "${link%%:*}" "$out/any.pcap"
+  "$ctl" decode --json "$out/any.pcap" > "$out/any.json" 2> "$out/any.err"
+  check "${link#*:}: the same frames" diff "$out/decode.json" "$out/any.json"
+  check "${link#*:}: and the loopback packet counted" grep -qx "kestrelctl: $(wc -l < \
+"$out/printed.txt") frames of netlink protocol 23; 1 packets of other protocols skipped" \
+    "$out/any.err"
+done
+
+# Live on the namespace's loopback, as Ethernet (lo) and as LINUX_SLL (any), ended by Ctrl-C or by
+# --seconds: every packet seen is counted as carrying no netlink (this host has no nlmon), and the
+# capture kept reads back the same. Each run ends within 30 s whatever happens.
+kept() { "$ctl" decode "$out/live.pcap" 2>&1 | sed -nE 's/.*; ([0-9]+) packets .*/\1/p'; }
+ip link set lo up
+for run in "lo EN10MB int" "any LINUX_SLL --seconds=3"; do
+  set -- $run
+  rm -f "$out/live.pcap" "$out/live.err"
+  timeout -s KILL 30 "$ctl" decode --live "$1" --pcap "$out/live.pcap" ${3#int} \
+    > "$out/live.txt" 2> "$out/live.err" &
+  live=$!
+  for _ in $(seq 100); do grep -q listening "$out/live.err" && break; sleep 0.1; done
+  for port in 9 10 11; do echo probe > /dev/udp/127.0.0.1/$port; done
+  if [ "$3" = int ]; then  # once the probes and their answers are in, Ctrl-C
+    for _ in $(seq 100); do [ "$(kept)" -ge 6 ] 2>/dev/null && break; sleep 0.1; done
+    kill -INT $(pgrep -P $live) 2>/dev/null || true
+  fi
+  status=0; wait $live || status=$?; live=
+  check "live on $1 ($2): started" grep -qx "kestrelctl: listening on $1, link type $2.*" \
+    "$out/live.err"
+  seen=$(sed -nE 's/^kestrelctl: 0 frames of netlink protocol 23; ([0-9]+) packets .*/\1/p' \
+    "$out/live.err")
+  check "live on $1 ($3): exit 0, the 3 probes and their answers counted" \
+    test "$status" = 0 -a "${seen:-0}" -ge 6 -a ! -s "$out/live.txt"
+  check "live on $1: the capture kept holds them" test "$(kept)" = "$seen"
+done
 
 # A file that ends inside its last packet, and a capture whose packets were cut to 40 bytes: the
 # frames before the packet, then an error that names it, exit status 4.

@@ -98,6 +98,11 @@ TEST_F(KestrelctlCli, EachCommandSendsItsFrameOrIsAUsageError) {
       {"send 65536", {}, "command 65536 does not fit the 16-bit nlmsg_type"},
       {"raw 123", {}, "raw: odd number of hex digits"},
       {"calib read accel --flag 1", {}, "--flag applies to calib store only"},
+      {"status accel --seconds 1", {}, "--seconds applies to stream, listen and decode --live only"},
+      {"decode x.pcap --pcap y.pcap", {}, "--pcap does not apply to decode"},
+      {"mag fuse", {}, "usage: kestrelctl mag fuserom | mag registers"},
+      {"decode --live lo x", {}, "usage: kestrelctl decode --live IFACE [--seconds N] [--pcap FILE] "
+                                 "[--csv FILE] [--plot FILE]"},
       {"status accel --timeout 0", {}, "--timeout needs a number of seconds above 0, not '0'"},
       {"--verbose status accel", {}, "unknown option --verbose"},
       // clang-format on

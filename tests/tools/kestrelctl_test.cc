@@ -1,5 +1,5 @@
 // kestrelctl's library: command frames byte for byte, the decoding of every frame type the
-// daemon sends (text and JSON), and the parsing of sensors and numbers.
+// daemon sends (text and JSON), the parsing of sensors and numbers, and the help of the tables.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
@@ -7,6 +7,7 @@
 #include <tuple>
 #include <vector>
 
+#include "command_table.h"
 #include "daemon_frames.h"
 #include "frame_codec.h"
 #include "frame_decoder.h"
@@ -170,6 +171,19 @@ TEST(KestrelctlParse, NumbersAndSensors) {
   for (const char* text : bad) EXPECT_FALSE(parse_sensor(text, &v)) << text;
   EXPECT_EQ(sensor_type_name(8), "mag");
   EXPECT_EQ(sensor_type_name(-1), "no sensor");
+}
+
+// The help shows every command's usage line and every option, each on a line of its own.
+TEST(KestrelctlHelp, ShowsEveryCommandAndOption) {
+  const std::string help = help_text();
+  std::vector<std::string> labels;
+  for (const Command& c : command_table()) labels.push_back(c.usage());
+  for (const OptionSpec& o : option_table()) labels.push_back(o.name);
+  for (const std::string& label : labels) {
+    const size_t at = help.find("\n  " + label);
+    ASSERT_NE(at, std::string::npos) << label;
+    EXPECT_THAT(help.substr(at + 3 + label.size(), 1), testing::AnyOf(" ", "\n")) << label;
+  }
 }
 
 }  // namespace

@@ -51,13 +51,15 @@ refused() {  # a bad write: kestrelctl fails and the module counts it as rejecte
   ! ctl raw "$@" && [ "$(counter rejected)" -eq $((before + 1)) ]
 }
 capture() {  # interface, file: dumpcap where the VM has it, else kestrelctl's live decoder
-  if command -v dumpcap > /dev/null; then dumpcap -q -P -i "$1" -w "$2"
-  else $build/tools/ctl/kestrelctl decode --live "$1" --pcap "$2" > /dev/null; fi
+  if command -v dumpcap > /dev/null; then exec dumpcap -q -P -i "$1" -w "$2"
+  else exec $build/tools/ctl/kestrelctl decode --live "$1" --pcap "$2" > /dev/null; fi
 }
 nlmon_up() {
   insmod /lib/modules/nlmon.ko && ip link add nlmon0 type nlmon && ip link set nlmon0 up || return 1
+  set -m  # a job of its own, so that it takes SIGINT as from a terminal
   capture nlmon0 "$res/nlmon.pcap" 2> "$res/capture.log" &
   capturer=$!
+  set +m
   sleep 1
 }
 stop() {  # signal, pid: the signal, then SIGKILL when the process has not ended within 5 s

@@ -2,8 +2,8 @@
 // device, so that a capture taken on a workstation and one taken on the phone read alike in
 // kestrelctl, tcpdump, tshark and Wireshark. libpcap writes and reads the files.
 //
-// The file has link type LINKTYPE_NETLINK (253). Each packet is one datagram behind a 16-byte
-// header, every field in network byte order:
+// The files kestrelctl writes have link type LINKTYPE_NETLINK (253). Each packet is one datagram
+// behind a 16-byte header, every field in network byte order:
 //
 //   offset 0   u16  packet type: 4 for a datagram the kernel's side sent, 0 for one it received
 //   offset 2   u16  ARPHRD type, 824 (netlink)
@@ -15,6 +15,20 @@
 // time stamp and lengths; the 16-byte header is ours. The host build talks netlink protocol 2
 // (NETLINK_USERSOCK) where the phone talks 23, but its captures say 23, as the phone's would: the
 // frames are the same, and so is everything that reads them.
+//
+// The reader also takes what tcpdump writes on the "any" interface: LINKTYPE_LINUX_SLL (113),
+// the same 16-byte header, and LINKTYPE_LINUX_SLL2 (276), a 20-byte one:
+//
+//   offset 0   u16  protocol (the netlink protocol when the ARPHRD type is 824)
+//   offset 2   u16  reserved
+//   offset 4   u32  interface index
+//   offset 8   u16  ARPHRD type
+//   offset 10  u8   packet type
+//   offset 11  u8   link-layer address length
+//   offset 12  8    link-layer address
+//
+// Packets of any other link type carry no netlink; they are read, and counted by whoever skips
+// them. The same reader takes packets live from an interface.
 #pragma once
 
 #include <stddef.h>
@@ -75,14 +89,29 @@ class CaptureReader {
   CaptureReader& operator=(const CaptureReader&) = delete;
 
   bool open(const std::string& path, std::string* error);
+  // Packets as they pass an interface (an nlmon device, or "any"), each as soon as it is seen.
+  bool open_live(const std::string& interface, std::string* error);
+  // Also writes every packet read, with the link type it has, to the capture at path; appends
+  // when the file is a capture of that link type already.
+  bool keep(const std::string& path, std::string* error);
+
+  // "NETLINK", "LINUX_SLL", ... or the number of a link type libpcap has no name for.
+  std::string link_type_name() const;
+  // Whether packets of this link type can hold netlink datagrams.
+  bool carries_netlink() const;
 
   enum class Next { kPacket, kEnd, kError };
   // The next packet. kError names the packet that could not be read: the file ends inside it,
-  // or it is too short for its 16-byte header.
-  Next next(CapturedPacket* packet, std::string* error);
+  // or it is too short for its link-layer header. Live, it waits for one until timeout_ms
+  // (-1: no limit) has passed or a signal has come (both kEnd).
+  Next next(CapturedPacket* packet, std::string* error, int timeout_ms = -1);
 
  private:
+  Next wait_live(int timeout_ms, std::string* error);
+
   struct pcap* pcap_ = nullptr;
+  struct pcap_dumper* dumper_ = nullptr;
+  bool live_ = false;
   uint64_t count_ = 0;
 };
 

@@ -4,6 +4,7 @@
 
 #include "byte_order.h"
 #include "kernel_frame.h"
+#include "kernel_sensors.h"
 
 namespace kestrelctl {
 namespace {
@@ -50,7 +51,7 @@ std::vector<uint8_t> build_bigdata(uint16_t command, int32_t sensor_type,
 }
 
 std::vector<uint8_t> build_hidden_hole(const std::array<int32_t, 9>& coefficients) {
-  std::vector<int32_t> words{kLightSensorType};
+  std::vector<int32_t> words{SENSOR_TYPE_LIGHT};
   words.insert(words.end(), coefficients.begin(), coefficients.end());
   return build_command(NETLINK_MESSAGE_SET_HIDDEN_HOLE_DATA, words);
 }

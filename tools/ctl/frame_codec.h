@@ -45,7 +45,6 @@ std::vector<uint8_t> build_bigdata(uint16_t command, int32_t sensor_type,
 
 // The light sensor's hidden-hole coefficients (command 35): sensor_type 4, then d_factor, r, g,
 // b, c, ct, ct_offset, th_high and th_low.
-constexpr int32_t kLightSensorType = 4;
 std::vector<uint8_t> build_hidden_hole(const std::array<int32_t, 9>& coefficients);
 
 // Splits a datagram as the daemon's own frame walk does (4-byte aligned steps).

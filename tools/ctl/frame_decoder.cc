@@ -5,45 +5,13 @@
 
 #include "byte_order.h"
 #include "kernel_frame.h"
+#include "kernel_sensors.h"
 #include "sensor_names.h"
 
 namespace kestrelctl {
 namespace {
 
 constexpr size_t kTextNameWidth = 18;
-
-struct Layout {
-  uint16_t type;
-  const char* name;
-  size_t payload_size;
-};
-
-// Every frame type the daemon sends, with the payload size its layout needs.
-constexpr Layout kLayouts[] = {
-    {FRAME_STATUS, "status", sizeof(status_reply)},
-    {FRAME_SAMPLE, "sample", sizeof(sample_frame)},
-    {FRAME_STOP_RAW_DATA, "stop", sizeof(stop_reply)},
-    {FRAME_CALIBRATION_REPORT, "calibration_report", sizeof(calibration_report)},
-    {FRAME_STORE_CALIBRATION, "store_calibration", sizeof(store_calib_reply)},
-    {FRAME_SELFTEST, "selftest", sizeof(selftest_reply)},
-    {FRAME_GYRO_TEMPERATURE, "gyro_temperature", sizeof(gyro_reply)},
-    {FRAME_MAG_FUSE_ROM, "mag_fuse_rom", sizeof(mag_reply)},
-    {FRAME_MAG_REGISTERS, "mag_registers", sizeof(mag_reply)},
-    {FRAME_GYRO_SELFTEST, "gyro_selftest", sizeof(gyro_reply)},
-    {FRAME_ACCEL_LPF_ON, "lpf_on", sizeof(lpf_result)},
-    {FRAME_ACCEL_LPF_OFF, "lpf_off", sizeof(lpf_result)},
-    {FRAME_REGISTER_DUMP, "register_dump", sizeof(register_dump_frame)},
-    {FRAME_THRESHOLD, "threshold", sizeof(threshold_reply_frame)},
-    {FRAME_HD_THRESHOLD, "hd_threshold", sizeof(threshold_reply_frame)},
-    {FRAME_HH_REFRESH, "hh_refresh", 2},
-};
-
-const Layout* layout_of(uint16_t type) {
-  for (const Layout& l : kLayouts) {
-    if (l.type == type) return &l;
-  }
-  return nullptr;
-}
 
 std::string printf_string(const char* format, double a, double b, double c) {
   char buf[128];
@@ -126,10 +94,10 @@ void decode_sample(const Frame& f, DecodedFrame* d) {
   add_code(d, "code", code);
   const SampleScale scale = sample_scale(code);
   std::string text;
-  if (code == 0 || code == 1 || code == 2) {
+  if (code == SENSOR_CODE_ACCEL || code == SENSOR_CODE_GYRO || code == SENSOR_CODE_MAG) {
     text = "x=" + std::to_string(values[0]) + " y=" + std::to_string(values[1]) +
            " z=" + std::to_string(values[2]) +
-           printf_string(code == 0 ? " (%.3f %.3f %.3f " : " (%.2f %.2f %.2f ",
+           printf_string(code == SENSOR_CODE_ACCEL ? " (%.3f %.3f %.3f " : " (%.2f %.2f %.2f ",
                          values[0] * scale.per_count, values[1] * scale.per_count,
                          values[2] * scale.per_count) +
            scale.unit + ")";
@@ -155,7 +123,7 @@ void decode_calibration_report(const Frame& f, DecodedFrame* d) {
     if (i > 0) text += " ";
     char buf[16];
     // The magnetometer's words are register values, easier to read in hex.
-    snprintf(buf, sizeof buf, code == 2 ? "0x%08x" : "%u", w);
+    snprintf(buf, sizeof buf, code == SENSOR_CODE_MAG ? "0x%08x" : "%u", w);
     text += buf;
   }
   d->fields.push_back(Field{"words", json_array(words), text});
@@ -163,9 +131,10 @@ void decode_calibration_report(const Frame& f, DecodedFrame* d) {
   std::string note;
   if (result == -1) {
     note = "no calibration, or a registry error";
-  } else if (code == 0 && result == 1) {
+  } else if (code == SENSOR_CODE_ACCEL && result == 1) {
     note = "calibrated";
-  } else if ((code == 1 || code == 2 || code == 5) && result == 0) {
+  } else if ((code == SENSOR_CODE_GYRO || code == SENSOR_CODE_MAG || code == SENSOR_CODE_LIGHT) &&
+             result == 0) {
     note = "read";
   }
   d->fields.push_back(number("result", result, note));
@@ -187,7 +156,7 @@ void decode_selftest(const Frame& f, DecodedFrame* d) {
   const int32_t sensor = word(f, 0);
   const int32_t result = word(f, 1);
   add_sensor_type(d, "sensor_type", sensor);
-  if (sensor == 0) {
+  if (sensor == SENSOR_TYPE_ACCEL) {
     constexpr int kSource[9] = {-1, 0, 4, 5, 6, 7, 1, 2, 3};  // accel_result word of frame word
     std::vector<int64_t> accel(8);
     d->fields.push_back(
@@ -201,7 +170,7 @@ void decode_selftest(const Frame& f, DecodedFrame* d) {
       }
     }
     d->fields.push_back(json_only("accel_result", json_array(accel)));
-  } else if (sensor == 2) {
+  } else if (sensor == SENSOR_TYPE_MAG) {
     std::vector<int64_t> mag{result, word(f, 2)};
     for (int w = 9; w <= 16; ++w) mag.push_back(word(f, w));
     d->fields.push_back(
@@ -212,7 +181,7 @@ void decode_selftest(const Frame& f, DecodedFrame* d) {
           text_only("mag_result[" + std::to_string(i) + "]", std::to_string(mag[i])));
     }
     d->fields.push_back(json_only("mag_result", json_array(mag)));
-  } else if (sensor == 3) {
+  } else if (sensor == SENSOR_TYPE_PRESSURE) {
     d->fields.push_back(
         Field{"result", std::to_string(result), with_note(result, verdict(result == 1))});
     d->fields.push_back(json_only("verdict", json_string(verdict(result == 1))));
@@ -295,7 +264,8 @@ void decode_register_dump(const Frame& f, DecodedFrame* d) {
   const uint8_t index = load_u8(f.payload.data(), offsetof(register_dump_frame, index));
   const uint8_t* registers = f.payload.data() + offsetof(register_dump_frame, registers);
   // Dumps 4 and 5 (the light sensor) hold registers 0x80 to 0xff.
-  const unsigned first = (index == 4 || index == 5) ? 0x80 : 0x00;
+  const unsigned first =
+      (index == SENSOR_TYPE_LIGHT || index == SENSOR_TYPE_LIGHT_SHORT) ? 0x80 : 0x00;
   add_sensor_type(d, "index", index);
   char range[16];
   snprintf(range, sizeof range, "0x%02x-0x%02x", first, first + 127);
@@ -329,21 +299,21 @@ void decode_threshold(const Frame& f, DecodedFrame* d, bool hd) {
 
 void decode_hh_refresh(const Frame& f, DecodedFrame* d) {
   const uint16_t value = load_u16(f.payload.data(), 0);
-  d->fields.push_back(
-      number("value", value, value == 260 ? "refresh the light-sensor coefficients" : ""));
+  d->fields.push_back(number(
+      "value", value, value == kHhRefreshValue ? "refresh the light-sensor coefficients" : ""));
 }
 
 }  // namespace
 
 SampleScale sample_scale(int32_t code) {
   switch (code) {
-    case 0:
+    case SENSOR_CODE_ACCEL:
       return {"acceleration", "g", "g", 1.0 / 4096, 3};
-    case 1:
+    case SENSOR_CODE_GYRO:
       return {"angular rate", "\u00b0/s", "dps", 1.0 / 70, 3};
-    case 2:
+    case SENSOR_CODE_MAG:
       return {"magnetic field", "\u00b5T", "uT", 0.15, 3};
-    case 3:
+    case SENSOR_CODE_PRESSURE:
       return {"value", "counts", "counts", 1.0, 3};
     default:
       return {"value", "counts", "counts", 1.0, 6};
@@ -356,8 +326,8 @@ std::string axis_name(size_t axes, size_t index) {
 }
 
 std::string frame_type_name(uint16_t type) {
-  const Layout* l = layout_of(type);
-  return l != nullptr ? l->name : "unknown";
+  const outbound_frame* f = outbound_frame_of(type);
+  return f != nullptr ? f->name : "unknown";
 }
 
 namespace {
@@ -422,7 +392,7 @@ DecodedFrame decode_frame(const Frame& frame) {
   d.frame = frame;
   if (decode_malformed(frame, &d)) return d;
   d.name = frame_type_name(frame.type);
-  const Layout* layout = layout_of(frame.type);
+  const outbound_frame* layout = outbound_frame_of(frame.type);
   if (layout == nullptr) return d;
   if (frame.payload.size() < layout->payload_size) {
     d.problem = "a payload of " + std::to_string(frame.payload.size()) +

@@ -1,5 +1,7 @@
 #include "sensor_names.h"
 
+#include "kernel_sensors.h"
+
 namespace kestrelctl {
 namespace {
 
@@ -10,13 +12,13 @@ struct NamedSensor {
 };
 
 constexpr NamedSensor kNamedSensors[] = {
-    {"accel", "accelerometer", 0}, {"gyro", "gyroscope", 1}, {"mag", "magnetometer", 2},
-    {"pressure", "pressure", 3},   {"light", "light", 4},    {"light-short", "light-short", 5},
+    {"accel", "accelerometer", SENSOR_TYPE_ACCEL},
+    {"gyro", "gyroscope", SENSOR_TYPE_GYRO},
+    {"mag", "magnetometer", SENSOR_TYPE_MAG},
+    {"pressure", "pressure", SENSOR_TYPE_PRESSURE},
+    {"light", "light", SENSOR_TYPE_LIGHT},
+    {"light-short", "light-short", SENSOR_TYPE_LIGHT_SHORT},
 };
-
-// The daemon's sensor-manager id of each sensor_type.
-constexpr int32_t kSmgrIdBySensorType[16] = {0,  10, 20, 30, 40, 40, 60, -1,
-                                             20, 20, -1, 10, 0,  0,  0,  0};
 
 int digit_value(char c, int base) {
   int d = -1;
@@ -24,25 +26,6 @@ int digit_value(char c, int base) {
   if (c >= 'a' && c <= 'f') d = c - 'a' + 10;
   if (c >= 'A' && c <= 'F') d = c - 'A' + 10;
   return d < base ? d : -1;
-}
-
-std::string smgr_sensor_name(int32_t id) {
-  switch (id) {
-    case 0:
-      return "accel";
-    case 10:
-      return "gyro";
-    case 20:
-      return "mag";
-    case 30:
-      return "pressure";
-    case 40:
-      return "light";
-    case 60:
-      return "sensor 60";
-    default:
-      return "no sensor";
-  }
 }
 
 }  // namespace
@@ -89,39 +72,20 @@ bool parse_sensor(const std::string& text, int32_t* sensor_type) {
   return parse_int32(text, sensor_type);
 }
 
-int32_t smgr_id_of(int32_t sensor_type) {
-  if (sensor_type < 0 || sensor_type > 15) return -1;
-  return kSmgrIdBySensorType[sensor_type];
-}
-
 std::string sensor_type_name(int32_t sensor_type) {
   for (const NamedSensor& s : kNamedSensors) {
     if (s.sensor_type == sensor_type) return s.name;
   }
-  return smgr_sensor_name(smgr_id_of(sensor_type));
+  const kernel_sensor* sensor = kernel_sensor_of(smgr_id_by_sensor_type(sensor_type));
+  return sensor != nullptr ? sensor->name : "no sensor";
 }
 
 std::string sensor_code_name(int32_t code) {
-  switch (code) {
-    case 0:
-      return "accel";
-    case 1:
-      return "gyro";
-    case 2:
-      return "mag";
-    case 3:
-      return "pressure";
-    case 4:
-      return "raw data";
-    case 5:
-      return "light";
-    case 6:
-      return "sensor 60";
-    case -1:
-      return "no sensor";
-    default:
-      return "unknown code";
+  for (const kernel_sensor& s : kKernelSensors) {
+    if (s.code == code) return s.name;
   }
+  if (code == SENSOR_CODE_RAW) return "raw data";
+  return code == SENSOR_CODE_NONE ? "no sensor" : "unknown code";
 }
 
 }  // namespace kestrelctl

@@ -1,6 +1,5 @@
-// Sensor names and numbers as the kernel factory driver uses them. Commands carry a sensor_type
-// (0 to 15 on the phone, any signed 32-bit value on the wire); replies carry either that index
-// or the kernel's sensor code, which the daemon derives from the sensor-manager id.
+// Sensors and numbers on kestrelctl's command line, and the names of sensor_types and sensor codes
+// (kernel_sensors.h) in what it prints.
 #pragma once
 
 #include <stdint.h>
@@ -16,10 +15,6 @@ bool parse_int32(const std::string& text, int32_t* value);
 // A sensor by name (accel, gyro, mag, pressure, light, light-short, or the long names
 // accelerometer, gyroscope, magnetometer) or by sensor_type number (parse_int32).
 bool parse_sensor(const std::string& text, int32_t* sensor_type);
-
-// The sensor-manager id the daemon uses for a sensor_type: 0, 10, 20, 30, 40, 60, or -1 for
-// none (7, 10 and everything outside 0..15).
-int32_t smgr_id_of(int32_t sensor_type);
 
 // What a sensor_type stands for: "accel" ... "light-short" for 0 to 5, else the sensor of its
 // sensor-manager id ("mag" for 8), "sensor 60", or "no sensor".
