@@ -1,42 +1,24 @@
 #include "bench/bench_support.h"
 
-#include <dirent.h>
 #include <errno.h>
-#include <fcntl.h>
 #include <linux/netlink.h>
 #include <poll.h>
-#include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
-#include <sys/prctl.h>
 #include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
 #include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <cmath>
 #include <fstream>
-#include <sstream>
-
-#include "tools/soak/daemon_driver.h"
-
-extern char** environ;
 
 namespace kestrel_bench {
 
 namespace {
 
 constexpr char kNamespaceMarker[] = "KESTREL_BENCH_NETNS";
-
-std::string read_file(const std::string& path) {
-  std::ifstream in(path);
-  std::stringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
 
 }  // namespace
 
@@ -61,106 +43,6 @@ int64_t now_ns() {
   timespec ts;
   clock_gettime(CLOCK_MONOTONIC, &ts);
   return int64_t{ts.tv_sec} * 1000000000 + ts.tv_nsec;
-}
-
-TempDir::TempDir()
-    : path_(std::make_unique<std::string>(kestrel_soak::make_run_dir("kestrel-bench"))) {
-  if (path_->empty()) {
-    fprintf(stderr, "cannot create a run directory: %s\n", strerror(errno));
-    exit(1);
-  }
-}
-
-TempDir::~TempDir() {
-  kestrel_soak::remove_run_dir(*path_);
-}
-
-ChildProcess::ChildProcess(const std::vector<std::string>& argv,
-                           const std::map<std::string, std::string>& env,
-                           const std::string& path_prepend, const std::string& stderr_path,
-                           const std::string& stdout_path) {
-  // Everything the child needs is prepared here: after fork only exec-safe calls are made.
-  std::map<std::string, std::string> merged;
-  for (char** e = environ; *e != nullptr; ++e) {
-    const char* eq = strchr(*e, '=');
-    if (eq != nullptr) merged[std::string(*e, static_cast<size_t>(eq - *e))] = eq + 1;
-  }
-  for (const auto& [name, value] : env) {
-    if (value.empty()) {
-      merged.erase(name);
-    } else {
-      merged[name] = value;
-    }
-  }
-  if (!path_prepend.empty()) {
-    merged["PATH"] = path_prepend + (merged.count("PATH") ? ":" + merged["PATH"] : "");
-  }
-  std::vector<std::string> env_strings;
-  for (const auto& [name, value] : merged) env_strings.push_back(name + "=" + value);
-  std::vector<char*> cenv;
-  for (std::string& s : env_strings) cenv.push_back(s.data());
-  cenv.push_back(nullptr);
-  std::vector<std::string> args = argv;
-  std::vector<char*> cargs;
-  for (std::string& a : args) cargs.push_back(a.data());
-  cargs.push_back(nullptr);
-
-  const int err_fd = open(stderr_path.empty() ? "/dev/null" : stderr_path.c_str(),
-                          O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-  const int out_fd = open(stdout_path.empty() ? "/dev/null" : stdout_path.c_str(),
-                          O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-  const int in_fd = open("/dev/null", O_RDONLY | O_CLOEXEC);
-  const pid_t parent = getpid();
-  fflush(stdout);
-  fflush(stderr);
-  pid_ = fork();
-  if (pid_ == 0) {
-    // Dies with the benchmark program, whatever ends it.
-    prctl(PR_SET_PDEATHSIG, SIGKILL);
-    if (getppid() != parent) _exit(127);
-    dup2(in_fd, 0);
-    dup2(out_fd, 1);
-    dup2(err_fd, 2);
-    execve(cargs[0], cargs.data(), cenv.data());
-    _exit(127);
-  }
-  close(err_fd);
-  close(out_fd);
-  close(in_fd);
-  if (pid_ < 0) {
-    fprintf(stderr, "fork: %s\n", strerror(errno));
-    exit(1);
-  }
-}
-
-ChildProcess::~ChildProcess() {
-  if (pid_ > 0 && !reaped_) {
-    kill(pid_, SIGKILL);
-    waitpid(pid_, nullptr, 0);
-  }
-}
-
-bool ChildProcess::running() {
-  if (pid_ <= 0 || reaped_) return false;
-  int status = 0;
-  if (waitpid(pid_, &status, WNOHANG) == pid_) {
-    reaped_ = true;
-    return false;
-  }
-  return true;
-}
-
-std::map<std::string, std::string> daemon_env(const TempDir& dir, const std::string& socket,
-                                              uint32_t kernel_port, double time_scale) {
-  std::map<std::string, std::string> env =
-      kestrel_soak::daemon_environment(dir.path(), socket, time_scale, "");
-  env["KESTREL_KERNEL_PORT"] = std::to_string(kernel_port);
-  // Nothing else of the caller's environment reaches the daemon's stand-ins ("" is unset).
-  for (const char* name : {"KESTREL_SENSOR_REG", "KESTREL_SENSOR1_INIT_RESULT", "KESTREL_DIAG_INIT",
-                           "KESTREL_DIAG_TX_MODE_RESULT"}) {
-    env[name] = "";
-  }
-  return env;
 }
 
 std::string kestreld_binary() {
@@ -270,104 +152,35 @@ void FrameDrain::run() {
   }
 }
 
-ProcessStatus process_status(pid_t pid) {
-  ProcessStatus s;
-  std::istringstream text(read_file("/proc/" + std::to_string(pid) + "/status"));
-  std::string line;
-  while (std::getline(text, line)) {
-    const size_t colon = line.find(':');
-    if (colon == std::string::npos) continue;
-    const std::string key = line.substr(0, colon);
-    const long value = strtol(line.c_str() + colon + 1, nullptr, 10);
-    if (key == "VmRSS") s.rss_kib = value;
-    if (key == "RssAnon") s.rss_anon_kib = value;
-    if (key == "RssFile") s.rss_file_kib = value;
-    if (key == "VmHWM") s.hwm_kib = value;
-    if (key == "Threads") s.threads = value;
-  }
-  return s;
-}
-
-long process_cpu_ticks(pid_t pid) {
-  const std::string stat = read_file("/proc/" + std::to_string(pid) + "/stat");
-  const size_t paren = stat.rfind(')');
-  if (paren == std::string::npos) return -1;
-  // After the command name: field 3 (state) onward; utime and stime are fields 14 and 15.
-  std::istringstream fields(stat.substr(paren + 1));
-  std::string field;
-  long utime = -1;
-  long stime = -1;
-  for (int n = 3; fields >> field && n <= 15; ++n) {
-    if (n == 14) utime = strtol(field.c_str(), nullptr, 10);
-    if (n == 15) stime = strtol(field.c_str(), nullptr, 10);
-  }
-  return utime < 0 || stime < 0 ? -1 : utime + stime;
-}
-
-namespace {
-
-// The sum of read(the thread's /proc directory) over the process's threads; -1 when unreadable.
-int64_t sum_over_threads(pid_t pid, const std::function<int64_t(const std::string&)>& read) {
-  const std::string dir = "/proc/" + std::to_string(pid) + "/task";
-  DIR* d = opendir(dir.c_str());
-  if (d == nullptr) return -1;
-  int64_t total = 0;
-  while (dirent* e = readdir(d)) {
-    if (e->d_name[0] != '.') total += read(dir + "/" + e->d_name);
-  }
-  closedir(d);
-  return total;
-}
-
-// Sums the named fields of each thread's status.
-long sum_task_status(pid_t pid, const std::vector<std::string>& fields) {
-  return static_cast<long>(sum_over_threads(pid, [&](const std::string& task) {
-    std::istringstream text(read_file(task + "/status"));
-    int64_t total = 0;
-    for (std::string line; std::getline(text, line);) {
-      for (const std::string& field : fields) {
-        if (line.rfind(field + ":", 0) == 0)
-          total += strtol(line.c_str() + field.size() + 1, nullptr, 10);
-      }
-    }
-    return total;
-  }));
-}
-
-}  // namespace
-
-long process_context_switches(pid_t pid) {
-  return sum_task_status(pid, {"voluntary_ctxt_switches", "nonvoluntary_ctxt_switches"});
-}
-
-long process_voluntary_switches(pid_t pid) {
-  return sum_task_status(pid, {"voluntary_ctxt_switches"});
-}
-
-int64_t process_cpu_ns(pid_t pid) {
-  return sum_over_threads(pid, [](const std::string& task) {
-    return strtoll(read_file(task + "/schedstat").c_str(), nullptr, 10);
-  });
-}
-
-long process_thread_count(pid_t pid) {
-  return static_cast<long>(sum_over_threads(pid, [](const std::string&) { return 1; }));
-}
-
-bool wait_until(const std::function<bool()>& cond, std::chrono::milliseconds timeout) {
-  const int64_t deadline = now_ns() + static_cast<int64_t>(timeout.count()) * 1000000;
-  for (;;) {
-    if (cond()) return true;
-    if (now_ns() > deadline) return false;
-    usleep(2000);
-  }
-}
-
 double median(std::vector<double> values) {
   if (values.empty()) return std::nan("");
   std::sort(values.begin(), values.end());
   const size_t n = values.size();
   return n % 2 == 1 ? values[n / 2] : (values[n / 2 - 1] + values[n / 2]) / 2;
+}
+
+double median_real_ns(const RunRecords& runs, const std::string& benchmark) {
+  const auto it = runs.find(benchmark);
+  return it == runs.end() ? std::nan("") : median(it->second.real_ns);
+}
+
+double mean_real_ns(const RunRecords& runs, const std::string& benchmark) {
+  const auto it = runs.find(benchmark);
+  return it == runs.end() ? std::nan("") : mean(it->second.real_ns);
+}
+
+double counter(const RunRecords& runs, const std::string& benchmark, const std::string& key) {
+  const auto it = runs.find(benchmark);
+  if (it == runs.end()) return std::nan("");
+  const auto c = it->second.counters.find(key);
+  return c == it->second.counters.end() ? std::nan("") : median(c->second);
+}
+
+double mean(const std::vector<double>& values) {
+  if (values.empty()) return std::nan("");
+  double sum = 0;
+  for (double v : values) sum += v;
+  return sum / static_cast<double>(values.size());
 }
 
 std::string format_number(double value, int decimals) {
@@ -427,15 +240,6 @@ class RecordingReporter : public benchmark::ConsoleReporter {
   RunRecords* records_;
 };
 
-std::string load_average() {
-  std::string text = read_file("/proc/loadavg");
-  // The three averages only.
-  std::istringstream in(text);
-  std::string a, b, c;
-  in >> a >> b >> c;
-  return a + " " + b + " " + c;
-}
-
 void print_summary(const std::string& title, const Summary& summary, const std::string& load_before,
                    const std::string& load_after) {
   printf("\n== %s\n", title.c_str());
@@ -471,12 +275,12 @@ int run_benchmarks(int argc, char** argv, const std::string& title,
                    const std::function<void()>& teardown) {
   benchmark::Initialize(&argc, argv);
   if (benchmark::ReportUnrecognizedArguments(argc, argv)) return 1;
-  const std::string load_before = load_average();
+  const std::string load_before = kestrel_driver::load_average();
   RunRecords records;
   RecordingReporter reporter(&records);
   benchmark::RunSpecifiedBenchmarks(&reporter);
   if (teardown) teardown();
-  const std::string load_after = load_average();
+  const std::string load_after = kestrel_driver::load_average();
   Summary summary;
   summarize(records, &summary);
   print_summary(title, summary, load_before, load_after);

@@ -1,6 +1,7 @@
-// What the benchmark programs share: a private network namespace, the kernel side of the netlink
-// channel, child processes (kestreld, kestrel-sim, the bare relays), /proc readings, and a
-// reporter that turns the runs into figures set against their limits.
+// What the benchmark programs share beside the daemon driver (the daemon, kestrel-sim and the bare
+// relays as child processes, and their /proc readings): a private network namespace, the kernel
+// side of the netlink channel, and a reporter that turns the runs into figures set against their
+// limits.
 //
 // Every program prints Google Benchmark's table, then a summary: one line a figure with the
 // daemon's value, the limit it is measured against, their ratio and the target. With
@@ -24,12 +25,14 @@
 #include <benchmark/benchmark.h>
 
 #include "tools/ctl/kernel_port.h"
+#include "tools/soak/daemon_driver.h"
+#include "tools/soak/proc_readings.h"
 
 namespace kestrel_bench {
 
-// Netlink port ids of the host build: the daemon's own and the one that plays the kernel.
-constexpr uint32_t kDaemonPort = 20000;
-constexpr uint32_t kKernelPort = 100;
+using kestrel_driver::kDaemonPort;
+using kestrel_driver::kKernelPort;
+using kestrel_driver::wait_until;
 
 // Re-executes the program under `unshare -rn` (`unshare -n` where user namespaces are not
 // available) unless it already runs in the namespace it made. Netlink port ids and the daemon's
@@ -38,45 +41,6 @@ void enter_private_network_namespace(int argc, char** argv);
 
 // Nanoseconds of the monotonic clock.
 int64_t now_ns();
-
-// A directory of its own under the system's temporary directory, removed with everything in it.
-// Its bin/ holds do-nothing stand-ins of the shell tools the daemon runs (diag_mdlog, chown,
-// chmod), so DIAG start-up costs a fork and nothing more.
-class TempDir {
- public:
-  TempDir();  // kestrel-soak's run directory: bin() is its tools/
-  ~TempDir();
-  const std::string& path() const { return *path_; }
-  std::string file(const std::string& name) const { return *path_ + "/" + name; }
-  std::string bin() const { return *path_ + "/tools"; }
-
- private:
-  std::unique_ptr<const std::string> path_;  // one owner removes the directory
-};
-
-// A child process: argv[0] is run with the current environment plus env (PATH gets path_prepend
-// in front); stdout and stderr go to the named files ("" for /dev/null). Killed and reaped when
-// destroyed.
-class ChildProcess {
- public:
-  ChildProcess(const std::vector<std::string>& argv, const std::map<std::string, std::string>& env,
-               const std::string& path_prepend = "", const std::string& stderr_path = "",
-               const std::string& stdout_path = "");
-  ~ChildProcess();
-  ChildProcess(const ChildProcess&) = delete;
-  ChildProcess& operator=(const ChildProcess&) = delete;
-  pid_t pid() const { return pid_; }
-  bool running();
-
- private:
-  pid_t pid_ = -1;
-  bool reaped_ = false;
-};
-
-// The environment of a daemon under measurement: its sensor1 socket, its kernel port, a time
-// scale that shortens the start-up delays, and a system root without DIAG-mode files.
-std::map<std::string, std::string> daemon_env(const TempDir& dir, const std::string& socket,
-                                              uint32_t kernel_port, double time_scale);
 
 // Paths of the programs under measurement, set by the build.
 std::string kestreld_binary();
@@ -121,31 +85,6 @@ class FrameDrain {
   std::thread thread_;
 };
 
-// /proc/<pid> readings.
-struct ProcessStatus {
-  long rss_kib = -1;       // VmRSS
-  long rss_anon_kib = -1;  // RssAnon
-  long rss_file_kib = -1;  // RssFile
-  long hwm_kib = -1;       // VmHWM
-  long threads = -1;       // Threads
-};
-ProcessStatus process_status(pid_t pid);
-// utime + stime in clock ticks, -1 when unreadable.
-long process_cpu_ticks(pid_t pid);
-// Voluntary and involuntary context switches summed over the process's threads.
-long process_context_switches(pid_t pid);
-// Voluntary context switches alone (a thread blocked: it waited for a socket, a lock or a
-// condition), summed over the process's threads.
-long process_voluntary_switches(pid_t pid);
-// CPU time of the process's live threads in nanoseconds (first field of each thread's
-// schedstat), -1 when unreadable.
-int64_t process_cpu_ns(pid_t pid);
-// Number of threads (entries of /proc/<pid>/task).
-long process_thread_count(pid_t pid);
-
-// Polls cond every few milliseconds until it holds. False on timeout.
-bool wait_until(const std::function<bool()>& cond, std::chrono::milliseconds timeout);
-
 // Every run that the library reported, by benchmark name (repetitions together).
 struct RunRecord {
   std::vector<double> real_ns;  // real time of one iteration, nanoseconds
@@ -155,8 +94,15 @@ struct RunRecord {
 };
 using RunRecords = std::map<std::string, RunRecord>;
 
-// Median of the values; NaN when there are none.
+// Median and mean of the values; NaN when there are none.
 double median(std::vector<double> values);
+double mean(const std::vector<double>& values);
+// A benchmark's real time of one iteration, nanoseconds, as the median or the mean over its
+// repetitions; NaN when it did not run.
+double median_real_ns(const RunRecords& runs, const std::string& benchmark);
+double mean_real_ns(const RunRecords& runs, const std::string& benchmark);
+// The median over the repetitions of a benchmark's counter; NaN when it has none.
+double counter(const RunRecords& runs, const std::string& benchmark, const std::string& key);
 
 // One line of the summary: a figure of the daemon set against its limit.
 struct SummaryRow {

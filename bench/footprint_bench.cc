@@ -9,15 +9,14 @@
 #include <unistd.h>
 
 #include <cmath>
-#include <fstream>
-#include <sstream>
+#include <memory>
 
 #include "bench/bench_support.h"
 #include "kernel_frame.h"
 
 namespace {
 
-using kestrel_bench::ChildProcess;
+using kestrel_driver::ChildProcess;
 
 constexpr double kTimeScale = 0.05;
 constexpr double kRssTargetKib = 4096;
@@ -28,51 +27,46 @@ int idle_seconds() {
   return n > 0 ? n : 60;
 }
 
-bool file_contains(const std::string& path, const std::string& text) {
-  std::ifstream in(path);
-  std::stringstream all;
-  all << in.rdbuf();
-  return all.str().find(text) != std::string::npos;
-}
+// kestrel-sim and kestreld in dir, the daemon idle: connected to the simulator, the refresh
+// thread's frame sent, and only the threads that last (main and the sensor1 library's) left, for
+// a whole second. Empty, or what went wrong.
+struct IdleDaemon {
+  kestrel_driver::RunDir dir{"kestrel-bench"};
+  std::unique_ptr<ChildProcess> sim;
+  std::unique_ptr<ChildProcess> daemon;
+  std::string error;
+};
 
-void BM_IdleFootprint(benchmark::State& state) {
-  kestrel_bench::TempDir dir;
-  const std::string socket = dir.file("sensor1.sock");
-  const std::string log = dir.file("kestreld.log");
-  kestrel_bench::NetlinkPort kernel(kestrel_bench::kKernelPort);
-  if (!kernel.ok()) {
-    state.SkipWithError("the kernel side's netlink socket could not be bound");
-    return;
-  }
-  ChildProcess sim({kestrel_bench::kestrel_sim_binary(), "--quiet", "--socket", socket}, {});
+void start_idle(kestrel_bench::NetlinkPort* kernel, IdleDaemon* idle) {
+  const std::string socket = idle->dir.file("sensor1.sock");
+  idle->sim = std::make_unique<ChildProcess>(
+      std::vector<std::string>{kestrel_bench::kestrel_sim_binary(), "--quiet", "--socket", socket},
+      kestrel_driver::current_environment());
   if (!kestrel_bench::wait_until([&] { return access(socket.c_str(), F_OK) == 0; },
                                  std::chrono::seconds(10))) {
-    state.SkipWithError("kestrel-sim did not come up");
+    idle->error = "kestrel-sim did not come up";
     return;
   }
-  ChildProcess daemon(
-      {kestrel_bench::kestreld_binary()},
-      kestrel_bench::daemon_env(dir, socket, kestrel_bench::kKernelPort, kTimeScale), dir.bin(),
-      log);
-  const pid_t pid = daemon.pid();
-
-  // Idle: connected to the simulator, the refresh thread's frame sent, and only the threads that
-  // last (main and the sensor1 library's) left, for a whole second.
+  kestrel_driver::DaemonLog log(idle->dir.file("kestreld.log"));
+  idle->daemon = std::make_unique<ChildProcess>(
+      std::vector<std::string>{kestrel_bench::kestreld_binary()},
+      kestrel_driver::daemon_environment(idle->dir, socket, kTimeScale), log.path());
   std::vector<uint8_t> frame;
-  if (!kernel.receive_type(FRAME_HH_REFRESH, std::chrono::seconds(30), &frame)) {
-    state.SkipWithError("the refresh frame did not come");
+  if (!kernel->receive_type(FRAME_HH_REFRESH, std::chrono::seconds(30), &frame)) {
+    idle->error = "the refresh frame did not come";
     return;
   }
-  if (!kestrel_bench::wait_until([&] { return file_contains(log, "open -> 0"); },
+  if (!kestrel_bench::wait_until([&] { return log.update(), log.recent("open -> 0"); },
                                  std::chrono::seconds(10))) {
-    state.SkipWithError("kestreld did not connect to kestrel-sim");
+    idle->error = "kestreld did not connect to kestrel-sim";
     return;
   }
+  const pid_t pid = idle->daemon->pid();
   long threads = -1;
   int64_t stable_since = kestrel_bench::now_ns();
   kestrel_bench::wait_until(
       [&] {
-        const long n = kestrel_bench::process_thread_count(pid);
+        const long n = kestrel_driver::process_thread_count(pid);
         if (n != threads) {
           threads = n;
           stable_since = kestrel_bench::now_ns();
@@ -80,25 +74,46 @@ void BM_IdleFootprint(benchmark::State& state) {
         return n <= 2 && kestrel_bench::now_ns() - stable_since > 1000000000;
       },
       std::chrono::seconds(30));
+}
 
-  const kestrel_bench::ProcessStatus at_start = kestrel_bench::process_status(pid);
-  const long ticks_before = kestrel_bench::process_cpu_ticks(pid);
-  const int64_t cpu_ns_before = kestrel_bench::process_cpu_ns(pid);
-  const long switches_before = kestrel_bench::process_context_switches(pid);
+// What /proc says of the daemon's CPU time and context switches.
+struct CpuReadings {
+  long ticks;
+  int64_t ns;
+  long switches;
+};
+
+CpuReadings cpu_readings(pid_t pid) {
+  return {kestrel_driver::process_cpu_ticks(pid), kestrel_driver::process_cpu_ns(pid),
+          kestrel_driver::process_context_switches(pid)};
+}
+
+void BM_IdleFootprint(benchmark::State& state) {
+  kestrel_bench::NetlinkPort kernel(kestrel_bench::kKernelPort);
+  if (!kernel.ok()) {
+    state.SkipWithError("the kernel side's netlink socket could not be bound");
+    return;
+  }
+  IdleDaemon idle;
+  start_idle(&kernel, &idle);
+  if (!idle.error.empty()) {
+    state.SkipWithError(idle.error.c_str());
+    return;
+  }
+  const pid_t pid = idle.daemon->pid();
+  const kestrel_driver::ProcessStatus at_start = kestrel_driver::process_status(pid);
+  const CpuReadings before = cpu_readings(pid);
   const int seconds = idle_seconds();
   for (auto _ : state) {
     sleep(static_cast<unsigned>(seconds));
     state.SetIterationTime(seconds);
   }
-  const long ticks_after = kestrel_bench::process_cpu_ticks(pid);
-  const int64_t cpu_ns_after = kestrel_bench::process_cpu_ns(pid);
-  const long switches_after = kestrel_bench::process_context_switches(pid);
-  const kestrel_bench::ProcessStatus at_end = kestrel_bench::process_status(pid);
-  if (!daemon.running()) {
+  const CpuReadings after = cpu_readings(pid);
+  const kestrel_driver::ProcessStatus at_end = kestrel_driver::process_status(pid);
+  if (!idle.daemon->running()) {
     state.SkipWithError("kestreld ended while idle");
     return;
   }
-
   state.counters["rss_kib"] = static_cast<double>(at_start.rss_kib);
   state.counters["rss_anon_kib"] = static_cast<double>(at_start.rss_anon_kib);
   state.counters["rss_file_kib"] = static_cast<double>(at_start.rss_file_kib);
@@ -106,9 +121,9 @@ void BM_IdleFootprint(benchmark::State& state) {
   state.counters["rss_after_idle_kib"] = static_cast<double>(at_end.rss_kib);
   state.counters["threads"] = static_cast<double>(at_start.threads);
   state.counters["idle_s"] = seconds;
-  state.counters["cpu_ticks"] = static_cast<double>(ticks_after - ticks_before);
-  state.counters["cpu_ns"] = static_cast<double>(cpu_ns_after - cpu_ns_before);
-  state.counters["context_switches"] = static_cast<double>(switches_after - switches_before);
+  state.counters["cpu_ticks"] = static_cast<double>(after.ticks - before.ticks);
+  state.counters["cpu_ns"] = static_cast<double>(after.ns - before.ns);
+  state.counters["context_switches"] = static_cast<double>(after.switches - before.switches);
 }
 
 BENCHMARK(BM_IdleFootprint)
@@ -119,12 +134,7 @@ BENCHMARK(BM_IdleFootprint)
 
 void summarize(const kestrel_bench::RunRecords& runs, kestrel_bench::Summary* summary) {
   using namespace kestrel_bench;
-  auto it = runs.find("BM_IdleFootprint");
-  auto value = [&](const std::string& key) {
-    if (it == runs.end()) return std::nan("");
-    auto c = it->second.counters.find(key);
-    return c == it->second.counters.end() ? std::nan("") : median(c->second);
-  };
+  auto value = [&](const std::string& key) { return counter(runs, "BM_IdleFootprint", key); };
   const double rss = value("rss_kib");
   const double idle = value("idle_s");
   const double ticks = value("cpu_ticks");

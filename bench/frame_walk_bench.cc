@@ -122,10 +122,7 @@ BENCHMARK(BM_FrameWalkBareNoLog);
 
 void summarize(const kestrel_bench::RunRecords& runs, kestrel_bench::Summary* summary) {
   using namespace kestrel_bench;
-  auto per_frame = [&](const std::string& name) {
-    auto it = runs.find(name);
-    return it == runs.end() ? std::nan("") : median(it->second.real_ns) / kFrames;
-  };
+  auto per_frame = [&](const std::string& name) { return median_real_ns(runs, name) / kFrames; };
   const char* sinks[] = {"no-op logger", "stderr logger on /dev/null"};
   for (int sink = 0; sink < 2; ++sink) {
     const std::string arg = "/" + std::to_string(sink);

@@ -184,21 +184,14 @@ BENCHMARK(BM_FrameBlocks);
 
 void summarize(const kestrel_bench::RunRecords& runs, kestrel_bench::Summary* summary) {
   using namespace kestrel_bench;
-  auto ns = [&](const std::string& name) {
-    auto it = runs.find(name);
-    return it == runs.end() ? std::nan("") : median(it->second.real_ns);
-  };
-  auto counter = [&](const std::string& name, const std::string& key) {
-    auto it = runs.find(name);
-    if (it == runs.end()) return std::nan("");
-    auto c = it->second.counters.find(key);
-    return c == it->second.counters.end() ? std::nan("") : median(c->second);
-  };
-  const double daemon = counter("BM_SamplePathDaemon", "p50_frame_ns");
-  const double bare = counter("BM_SamplePathBareSendmsg", "p50_frame_ns");
+  auto ns = [&](const std::string& name) { return median_real_ns(runs, name); };
+  // Each repetition's real time is the mean over its batches; their mean over the repetitions.
+  auto mean_ns = [&](const std::string& name) { return mean_real_ns(runs, name); };
+  const double daemon = counter(runs, "BM_SamplePathDaemon", "p50_frame_ns");
+  const double bare = counter(runs, "BM_SamplePathBareSendmsg", "p50_frame_ns");
   const double ratio = daemon / bare;
-  const double daemon_mean = ns("BM_SamplePathDaemon") / kBatch;
-  const double bare_mean = ns("BM_SamplePathBareSendmsg") / kBatch;
+  const double daemon_mean = mean_ns("BM_SamplePathDaemon") / kBatch;
+  const double bare_mean = mean_ns("BM_SamplePathBareSendmsg") / kBatch;
   summary->add({"sample path: indication to kernel frame, median", format_ns(daemon),
                 "bare sendmsg of the frame " + format_ns(bare), format_ratio(ratio), "<= 1.25x",
                 verdict(ratio <= 1.25, !std::isnan(ratio))});
@@ -218,7 +211,7 @@ void summarize(const kestrel_bench::RunRecords& runs, kestrel_bench::Summary* su
                 "-", "-"});
   summary->note(
       "Per frame: the time of a batch of 64 divided by 64. Median: the median batch of a "
-      "repetition, then the median over the repetitions; mean: the mean batch, median over the "
+      "repetition, then the median over the repetitions; mean: the mean batch over all the "
       "repetitions. The daemon's path and the bare sendmsg ran interleaved, on the same socket, "
       "to the same kernel side.");
   summary->note(

@@ -32,8 +32,8 @@
 
 namespace {
 
-using kestrel_bench::ChildProcess;
 using kestrel_bench::FrameDrain;
+using kestrel_driver::ChildProcess;
 
 constexpr uint32_t kRelayKernelPort = 101;
 constexpr double kTimeScale = 0.05;
@@ -96,7 +96,7 @@ struct Side {
 };
 
 struct Setup {
-  kestrel_bench::TempDir dir;
+  kestrel_driver::RunDir dir{"kestrel-bench"};
   Side daemon;
   Side relay;
   std::string error;
@@ -118,23 +118,20 @@ Setup& setup() {
   s.daemon.sim = std::make_unique<kestrel_sim::Simulator>(daemon_socket);
   s.daemon.process = std::make_unique<ChildProcess>(
       std::vector<std::string>{kestrel_bench::kestreld_binary()},
-      kestrel_bench::daemon_env(s.dir, daemon_socket, kestrel_bench::kKernelPort, kTimeScale),
-      s.dir.bin());
+      kestrel_driver::daemon_environment(s.dir, daemon_socket, kTimeScale));
   const std::string relay_socket = s.dir.file("relay.sock");
   s.relay.sim = std::make_unique<kestrel_sim::Simulator>(relay_socket);
   s.relay.process = std::make_unique<ChildProcess>(
       std::vector<std::string>{kestrel_bench::self_binary(), "--relay=" + relay_socket},
-      std::map<std::string, std::string>{});
-  if (!s.daemon.sim->wait_for_connection(std::chrono::seconds(30)) ||
+      kestrel_driver::current_environment());
+  // Up: connected, its start-up threads ended (within a second at this time scale), only its
+  // main thread and the sensor1 library's thread left.
+  if (!kestrel_driver::wait_up(
+          s.daemon.process.get(), [&] { return s.daemon.sim->current_connection() != 0; }, 2,
+          std::chrono::seconds(30)) ||
       !s.relay.sim->wait_for_connection(std::chrono::seconds(30))) {
     s.error = "kestreld or the relay did not connect to its simulator";
-    return s;
   }
-  // The daemon's start-up threads end within a second at this time scale; only its main thread
-  // and the sensor1 library's thread stay.
-  const pid_t pid = s.daemon.process->pid();
-  kestrel_bench::wait_until([&] { return kestrel_bench::process_thread_count(pid) <= 2; },
-                            std::chrono::seconds(20));
   return s;
 }
 
@@ -229,12 +226,7 @@ BENCHMARK(BM_StreamBareRelay)
 
 void summarize(const kestrel_bench::RunRecords& runs, kestrel_bench::Summary* summary) {
   using namespace kestrel_bench;
-  auto rate = [&](const std::string& name) {
-    auto it = runs.find(name);
-    if (it == runs.end()) return std::nan("");
-    auto c = it->second.counters.find("lossless_rate");
-    return c == it->second.counters.end() ? std::nan("") : median(c->second);
-  };
+  auto rate = [&](const std::string& name) { return counter(runs, name, "lossless_rate"); };
   const double daemon = rate("BM_StreamDaemon");
   const double bare = rate("BM_StreamBareRelay");
   summary->add({"sustained stream: highest lossless sample rate", format_number(daemon, 0) + " /s",

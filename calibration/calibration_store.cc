@@ -23,7 +23,6 @@ constexpr uint16_t kTestRequestSize = sizeof(single_sensor_test_request);
 constexpr uint32_t kTestTypeFlagSet = 7;
 constexpr uint32_t kTestTypeFlagClear = 8;
 constexpr uint32_t kTestTypeMag = 0;
-constexpr uint32_t kTestTypeOther = 3;
 
 }  // namespace
 

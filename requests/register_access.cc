@@ -15,15 +15,10 @@ namespace {
 
 constexpr int32_t kReadFuseRom = 8;
 constexpr int32_t kReadRegisters = 9;
-constexpr uint32_t kTestTypeFuseRom = 9;
-constexpr uint32_t kTestTypeRegisters = 10;
-constexpr uint32_t kTestTypeOther = 3;
 constexpr int32_t kMagReplyCode = 2;
 
 constexpr int32_t kLpfOn = 12;
 constexpr int32_t kLpfOff = 13;
-constexpr uint32_t kTestTypeLpfOn = 11;
-constexpr uint32_t kTestTypeLpfOff = 12;
 
 constexpr int32_t kMotorEnabled = 14;
 constexpr int32_t kMotorDisabled = 15;

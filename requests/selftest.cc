@@ -12,9 +12,6 @@
 
 namespace {
 
-constexpr uint32_t kTestTypeSelftest = 6;
-constexpr uint32_t kTestTypeGyroTemperature = 13;
-constexpr uint32_t kTestTypeOther = 3;
 constexpr uint32_t kGyroTemperatureTest = 11;  // the selector of command 10
 
 // Word 0 of gyro_result: which gyroscope test the words hold.

@@ -12,11 +12,9 @@
 
 namespace {
 
-constexpr uint16_t kSensorStateRequestSize = 1;
-constexpr uint8_t kSensorStateMagic = 0xAA;
-constexpr uint16_t kStatusRequestSize = 3;
-constexpr uint16_t kCalResetRequestSize = 3;
-constexpr uint8_t kTxnCalReset = 4;
+constexpr uint16_t kSensorStateRequestSize = sizeof(sensor_state_request);
+constexpr uint16_t kStatusRequestSize = sizeof(status_request);
+constexpr uint16_t kCalResetRequestSize = sizeof(cal_reset_request);
 // The status request names a sensor outside the table by this id.
 constexpr int32_t kStatusOutOfRange = 255;
 

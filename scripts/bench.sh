@@ -3,12 +3,20 @@
 # of its own) and writes docs/performance.md from what they measured.
 #   BENCH_BUILD   build directory (default build-bench)
 #   BENCH_DOC     the document to write (default docs/performance.md)
+#   BENCH_QUICK   1: two repetitions each and 5 idle seconds, a look at whether everything runs;
+#                 the document then goes to the results directory unless BENCH_DOC names one
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
 dir=${BENCH_BUILD:-build-bench}
-doc=${BENCH_DOC:-docs/performance.md}
 out=$dir/bench-results
+quick=${BENCH_QUICK:-0}
+if [ "$quick" = 1 ]; then
+  doc=${BENCH_DOC:-$out/performance.md}
+  export KESTREL_BENCH_IDLE_SECONDS=5
+else
+  doc=${BENCH_DOC:-docs/performance.md}
+fi
 
 echo "== Building the benchmarks (Release) in $dir"
 cmake -S . -B "$dir" -G Ninja -DCMAKE_BUILD_TYPE=Release -DKESTREL_BUILD_TESTS=OFF \
@@ -42,11 +50,18 @@ run() {  # program, flags...
 }
 
 interleaved=(--benchmark_enable_random_interleaving=true)
+reps() {  # repetitions, minimum time of a repetition
+  if [ "$quick" = 1 ]; then
+    echo --benchmark_repetitions=2 --benchmark_min_time=0.05
+  else
+    echo --benchmark_repetitions="$1" --benchmark_min_time="$2"
+  fi
+}
 rm -f "$out"/*.md
-run sample_path_bench "${interleaved[@]}" --benchmark_repetitions=20 --benchmark_min_time=0.1
-run frame_walk_bench "${interleaved[@]}" --benchmark_repetitions=10 --benchmark_min_time=0.1
-run round_trip_bench "${interleaved[@]}" --benchmark_repetitions=10 --benchmark_min_time=0.5
-run stream_bench "${interleaved[@]}"
+run sample_path_bench "${interleaved[@]}" $(reps 20 0.1)
+run frame_walk_bench "${interleaved[@]}" $(reps 10 0.1)
+run round_trip_bench "${interleaved[@]}" $(reps 10 0.5)
+run stream_bench "${interleaved[@]}" $([ "$quick" = 1 ] && echo --benchmark_repetitions=1)
 run footprint_bench
 load_end=$(load)
 
@@ -139,8 +154,10 @@ on `command_waiter`; and a response record before the indication, as the sensor 
 a self test. Every log goes to `/dev/null`. The figures are the median command (the mean, which
 also carries the commands that waited for a busy core, follows the first row). The CPU time adds
 up the run time of all the threads of a process over the timed commands; "blocked" counts their
-voluntary context switches, each a sleep and a wake-up; the log records are counted on a second
-daemon whose log goes to a file.
+voluntary context switches, each a sleep and a wake-up. Before the runs, a daemon of its own
+writes its log to a file: the log records of a self test are counted there, and the relays with
+the log duty replay the daemon's own records of one self test, its main thread's where the main
+thread writes them and its library thread's when the indication is read.
 
 EOF
 section round_trip_bench
@@ -228,7 +245,8 @@ prints Google Benchmark's table and its summary; the raw runs are kept in
 `build-bench/bench-results/` as JSON. A program can be run alone, with Google Benchmark's flags,
 for example `build-bench/bench/round_trip_bench --benchmark_repetitions=5`; it enters a network
 namespace of its own by itself. `KESTREL_BENCH_IDLE_SECONDS` shortens the idle period of
-`footprint_bench`.
+`footprint_bench`; `make bench BENCH_QUICK=1` runs every program briefly and leaves this page
+alone (its figures go to `build-bench/bench-results/performance.md`).
 EOF
 } >"$doc"
 

@@ -18,7 +18,7 @@ namespace {
 pthread_mutex_t register_dump_lock = PTHREAD_MUTEX_INITIALIZER;
 
 constexpr uint8_t kStateRecordEmpty = 255;
-constexpr size_t kRegisterCount = 128;
+constexpr size_t kRegisterCount = kDafRegisterCount;
 // Dumps 4 and 5 hold the upper half of their device's register space.
 constexpr uint8_t kFirstUpperHalfDump = 4;
 

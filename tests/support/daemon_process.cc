@@ -3,31 +3,23 @@
 #include <fcntl.h>
 #include <signal.h>
 #include <stdlib.h>
-#include <string.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
-#include <sstream>
-
 #include "test_env.h"
+#include "tools/soak/daemon_driver.h"
 
 #ifndef KESTRELD_BINARY
 #error "KESTRELD_BINARY must name the daemon under test"
 #endif
 
-extern char** environ;
-
 DaemonProcess::DaemonProcess(const DaemonEnv& env, const std::string& path_prepend) {
   static int started = 0;
   log_path_ = std::string(getenv("KESTREL_SENSOR1_SOCKET")) + ".daemon" +
               std::to_string(started++) + ".log";
-  std::map<std::string, std::string> merged;
-  for (char** e = environ; *e != nullptr; ++e) {
-    const char* eq = strchr(*e, '=');
-    if (eq != nullptr) merged[std::string(*e, static_cast<size_t>(eq - *e))] = eq + 1;
-  }
+  kestrel_driver::Environment merged = kestrel_driver::current_environment();
   for (const auto& kv : env) merged[kv.first] = kv.second;
   if (!path_prepend.empty()) merged["PATH"] = path_prepend + ":" + merged["PATH"];
   std::vector<std::string> strings;
@@ -68,26 +60,16 @@ std::string DaemonProcess::output() const {
   return read_file(log_path_);
 }
 
-// A line "<tag> <P> <MM-DD> <HH:MM:SS> <pid> <tid> <message>" (pid and tid padded with blanks)
-// starts a record; any other line continues the message before it. The last line, still being
-// written, is left out.
+// The last line, still being written, is left out.
 std::vector<LogRecord> DaemonProcess::records() const {
   const std::string text = output();
   std::vector<LogRecord> out;
   for (size_t start = 0, end; (end = text.find('\n', start)) != std::string::npos;
        start = end + 1) {
     const std::string line = text.substr(start, end - start);
-    std::istringstream in(line);
-    std::string tag, prio, date, time, pid, tid;
-    in >> tag >> prio >> date >> time >> pid >> tid;
-    const size_t p = prio.size() == 1 ? std::string("??VDIWEF").find(prio[0]) : 0;
-    if (p >= 2 && p != std::string::npos && date.size() == 5 && date[2] == '-' &&
-        time.size() == 8 && pid.find_first_not_of("0123456789") == std::string::npos &&
-        !tid.empty() && tid.find_first_not_of("0123456789") == std::string::npos) {
-      // Exactly one blank separates the thread id from the message, which may start with blanks.
-      const size_t at = in.eof() ? line.size() : static_cast<size_t>(in.tellg()) + 1;
-      out.push_back(
-          {static_cast<int>(p), tag, at < line.size() ? line.substr(at) : "", atol(tid.c_str())});
+    kestrel_driver::LogRecord r;
+    if (kestrel_driver::parse_log_record(line, &r)) {
+      out.push_back({r.priority, r.tag, r.message, r.tid});
     } else if (!out.empty()) {
       out.back().message += "\n" + line;
     }

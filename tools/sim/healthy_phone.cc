@@ -1,43 +1,29 @@
 #include "tools/sim/healthy_phone.h"
 
+#include <stdarg.h>
 #include <stdio.h>
 
 #include <algorithm>
-#include <optional>
+#include <climits>
 
-#include "byte_order.h"
 #include "sensor1_messages.h"
+#include "tools/sim/phone_bodies.h"
 
 namespace kestrel_sim {
 
 namespace {
 
 using Clock = std::chrono::steady_clock;
+using Body = std::vector<uint8_t>;
 
-// Size of every daf_response: result, error, then room for the threshold words and for the 128
-// register bytes of a dump at 12..139.
-constexpr size_t kDafResponseSize = 140;
-constexpr size_t kSensorStateResponseSize = 4 + kStateRecordSize * kStateRecordCount;
-constexpr size_t kReportResponseSize = 12;
 constexpr int kMaxRateHz = 1000;
 constexpr int kDefaultRateHz = 10;
 constexpr int kLightPollingHz = 10;
+constexpr size_t kStatusResponseSize = 3;
 
 // Q16 fixed point, as the sensor manager reports samples.
 constexpr int32_t q16(double v) {
   return static_cast<int32_t>(v * 65536.0);
-}
-
-uint8_t byte_at(const std::vector<uint8_t>& b, size_t offset) {
-  return offset < b.size() ? b[offset] : 0;
-}
-
-uint32_t u32_at(const std::vector<uint8_t>& b, size_t offset) {
-  return offset + 4 <= b.size() ? load_u32(b.data(), offset) : 0;
-}
-
-uint16_t u16_at(const std::vector<uint8_t>& b, size_t offset) {
-  return offset + 2 <= b.size() ? load_u16(b.data(), offset) : 0;
 }
 
 // Small deterministic noise in [-amplitude, amplitude], different per tick and axis.
@@ -49,228 +35,254 @@ int32_t noise(uint32_t tick, uint32_t axis, int32_t amplitude) {
   return static_cast<int32_t>(h % static_cast<uint32_t>(2 * amplitude + 1)) - amplitude;
 }
 
-bool known_test_sensor(uint8_t id) {
-  return id == kSmgrAccel || id == kSmgrGyro || id == kSmgrMag || id == kSmgrPressure ||
-         id == kSmgrLight || id == kSmgrId60;
+std::string format(const char* fmt, ...) __attribute__((format(printf, 1, 2)));
+std::string format(const char* fmt, ...) {
+  char text[160];
+  va_list args;
+  va_start(args, fmt);
+  vsnprintf(text, sizeof text, fmt, args);
+  va_end(args);
+  return text;
 }
 
-// Result words of a passed test, by sensor and test type; nullopt when the sensor manager has no
-// such sensor (no indication). Calibrations carry the option bytes 1, 1, 1, 1.
-std::optional<std::vector<int32_t>> test_words(uint8_t sensor, int32_t test_type,
-                                               bool calibration) {
-  switch (sensor) {
-    case kSmgrAccel:
-      if (test_type == 6) {
-        // Pass; output with self test off in mg (gravity on z); self-test status and the
-        // self-test deltas in mg.
-        return std::vector<int32_t>{1, 12, -8, 1003, 1, 310, -295, 380};
-      }
-      if (test_type == 11) return std::vector<int32_t>{11, 1};       // low-pass filter on
-      if (test_type == 12) return std::vector<int32_t>{12, 0};       // low-pass filter off
-      if (calibration) return std::vector<int32_t>{1, 23, -41, 12};  // offsets in mg
-      return std::vector<int32_t>{1};
-    case kSmgrGyro:
-      if (test_type == 6) {
-        // Self test, pass, zero-rate offsets in milli-dps x 1000, pass again, the outputs with
-        // self test off and on.
-        return std::vector<int32_t>{1, 1, 1250, -830, 410, 1, 12, -9, 5, 412, -391, 437};
-      }
-      if (test_type == 13) return std::vector<int32_t>{2, q16(27.5)};  // temperature, degC
-      return std::vector<int32_t>{3, 1, 1250, -830, 410};  // calibration: zero-rate offsets
-    case kSmgrMag:
-      if (test_type == 6) {
-        // Pass, no error, the self-test field per axis and the raw readings behind it.
-        return std::vector<int32_t>{1, 0, -30, 20, -700, 35, -42, 180, 1, 1};
-      }
-      if (test_type == 9) return std::vector<int32_t>{2, -3, 1};  // sensitivity adjustment
-      if (test_type == 10) {
-        // WIA1, WIA2, ST1, HXL, HXH, HYL, HYH, HZL, HZH, TMPS, ST2, CNTL2, CNTL3, TS1.
-        return std::vector<int32_t>{0x48, 0x09, 0x01, 0x2C, 0x00, 0xE4, 0xFF,
-                                    0x8A, 0xFE, 0x00, 0x18, 0x08, 0x00, 0x00};
-      }
-      if (calibration) return std::vector<int32_t>{1, 14, -6, 9};  // hard-iron offsets
-      return std::vector<int32_t>{1};
-    case kSmgrPressure:
-      return std::vector<int32_t>{1, 101325};  // pass, Pa
-    case kSmgrLight:
-    case kSmgrId60:
-      return std::vector<int32_t>{};
-    default:
-      return std::nullopt;
-  }
+// Result words of a passed test, by sensor and test type; the first row that matches wins. A
+// sensor the sensor manager does not have matches no row (no indication).
+constexpr int32_t kAnyTest = INT32_MIN;
+enum class Options { kAny, kCalibration };  // calibrations carry the option bytes 1, 1, 1, 1
+struct TestWords {
+  uint8_t sensor;
+  int32_t test_type;
+  Options options;
+  std::vector<int32_t> words;
+};
+const TestWords kTestWords[] = {
+    // Pass; output with self test off in mg (gravity on z); self-test status and the self-test
+    // deltas in mg.
+    {kSmgrAccel, kTestTypeSelftest, Options::kAny, {1, 12, -8, 1003, 1, 310, -295, 380}},
+    {kSmgrAccel, kTestTypeLpfOn, Options::kAny, {11, 1}},             // low-pass filter on
+    {kSmgrAccel, kTestTypeLpfOff, Options::kAny, {12, 0}},            // low-pass filter off
+    {kSmgrAccel, kAnyTest, Options::kCalibration, {1, 23, -41, 12}},  // offsets in mg
+    {kSmgrAccel, kAnyTest, Options::kAny, {1}},
+    // Self test, pass, zero-rate offsets in milli-dps x 1000, pass again, the outputs with self
+    // test off and on.
+    {kSmgrGyro,
+     kTestTypeSelftest,
+     Options::kAny,
+     {1, 1, 1250, -830, 410, 1, 12, -9, 5, 412, -391, 437}},
+    {kSmgrGyro, kTestTypeGyroTemperature, Options::kAny, {2, q16(27.5)}},  // temperature, degC
+    {kSmgrGyro, kAnyTest, Options::kAny, {3, 1, 1250, -830, 410}},         // calibration: zero rate
+    // Pass, no error, the self-test field per axis and the raw readings behind it.
+    {kSmgrMag, kTestTypeSelftest, Options::kAny, {1, 0, -30, 20, -700, 35, -42, 180, 1, 1}},
+    {kSmgrMag, kTestTypeFuseRom, Options::kAny, {2, -3, 1}},  // sensitivity adjustment
+    // WIA1, WIA2, ST1, HXL, HXH, HYL, HYH, HZL, HZH, TMPS, ST2, CNTL2, CNTL3, TS1.
+    {kSmgrMag,
+     kTestTypeRegisters,
+     Options::kAny,
+     {0x48, 0x09, 0x01, 0x2C, 0x00, 0xE4, 0xFF, 0x8A, 0xFE, 0x00, 0x18, 0x08, 0x00, 0x00}},
+    {kSmgrMag, kAnyTest, Options::kCalibration, {1, 14, -6, 9}},  // hard-iron offsets
+    {kSmgrMag, kAnyTest, Options::kAny, {1}},
+    {kSmgrPressure, kAnyTest, Options::kAny, {1, 101325}},  // pass, Pa
+    {kSmgrLight, kAnyTest, Options::kAny, {}},
+    {kSmgrId60, kAnyTest, Options::kAny, {}},
+};
+
+bool is_calibration(const single_sensor_test_request& r) {
+  return std::all_of(std::begin(r.option), std::end(r.option), [](uint8_t o) { return o == 1; });
 }
 
-// 128 register bytes of a dump, by the txn_id that names the sensor.
-std::vector<uint8_t> register_dump(uint8_t txn) {
-  std::vector<uint8_t> r(128, 0);
-  switch (txn) {
-    case kTxnRegisterDumpFirst:      // accelerometer (LSM6DSM)
-    case kTxnRegisterDumpFirst + 1:  // gyroscope, same chip
-      r[0x0F] = 0x6A;                // WHO_AM_I
-      r[0x10] = 0x4C;                // CTRL1_XL: 104 Hz, 8 g
-      r[0x11] = 0x4C;                // CTRL2_G: 104 Hz, 2000 dps
-      r[0x12] = 0x44;                // CTRL3_C: BDU, IF_INC
-      r[0x1E] = 0x07;                // STATUS: data ready
-      r[0x20] = 0xE0;                // OUT_TEMP
-      r[0x21] = 0x04;
-      r[0x22] = 0x03;  // gyroscope x, y, z: close to zero
-      r[0x24] = 0xFE;
-      r[0x25] = 0xFF;
-      r[0x26] = 0x01;
-      r[0x28] = 0x0C;  // accelerometer x, y, z: gravity on z
-      r[0x2A] = 0xF8;
-      r[0x2B] = 0xFF;
-      r[0x2D] = 0x10;
-      break;
-    case kTxnRegisterDumpFirst + 2:  // magnetometer (AK09916C)
-      r[0x00] = 0x48;                // WIA1
-      r[0x01] = 0x09;                // WIA2
-      r[0x10] = 0x01;                // ST1
-      r[0x11] = 0x2C;                // HXL, HXH, HYL, HYH, HZL, HZH
-      r[0x13] = 0xE4;
-      r[0x14] = 0xFF;
-      r[0x15] = 0x8A;
-      r[0x16] = 0xFE;
-      r[0x18] = 0x18;  // ST2
-      r[0x31] = 0x08;  // CNTL2: continuous, 100 Hz
-      break;
-    case kTxnRegisterDumpFirst + 3:  // pressure sensor (LPS22HB)
-      r[0x0F] = 0xB1;                // WHO_AM_I
-      r[0x10] = 0x30;                // CTRL_REG1: 25 Hz
-      r[0x11] = 0x10;                // CTRL_REG2: IF_ADD_INC
-      r[0x27] = 0x03;                // STATUS
-      r[0x28] = 0x00;                // 1013.25 hPa x 4096
-      r[0x29] = 0x54;
-      r[0x2A] = 0x3F;
-      r[0x2B] = 0xBE;  // 27.50 degC x 100
-      r[0x2C] = 0x0A;
-      break;
-    case kTxnRegisterDumpFirst + 4:  // light sensor, registers 0x80 to 0xff
-    case kTxnRegisterDumpLast:
-      r[0x00] = 0x03;  // ENABLE: power on, ALS
-      r[0x01] = 0xF6;  // ATIME
-      r[0x0F] = 0x01;  // CONTROL: gain 4x
-      r[0x12] = 0xE0;  // ID
-      r[0x13] = 0x11;  // STATUS
-      r[0x14] = 0x16;  // clear, red, green, blue channels
-      r[0x15] = 0x0D;
-      r[0x16] = 0x9C;
-      r[0x17] = 0x04;
-      r[0x18] = 0x8C;
-      r[0x19] = 0x05;
-      r[0x1A] = 0xF8;
-      r[0x1B] = 0x02;
-      break;
-    default:
-      break;
-  }
-  return r;
-}
-
-void fill_sensor_state_table(std::vector<uint8_t>* table) {
-  uint8_t* b = table->data();
-  const uint8_t ids[] = {kSmgrAccel, kSmgrGyro, kSmgrMag, kSmgrPressure, kSmgrLight, kSmgrId60};
-  for (size_t i = 0; i < kStateRecordCount; ++i) {
-    uint8_t* rec = b + kStateRecordsOffset + i * kStateRecordSize;
-    if (i >= sizeof ids) {
-      rec[0] = 255;  // empty
-      continue;
-    }
-    rec[0] = ids[i];
-    rec[1] = 0x01;   // online
-    rec[2] = 0x00;   // no error
-    rec[3] = 0x0A;   // reports: one per sensor line
-    rec[4] = 0x64;   // highest rate, Hz
-    rec[12] = 0x01;  // powered
-    rec[13] = 0x00;  // no fault
-  }
-}
-
-// The rules of the requests the daemon writes: each message's exact size and its txn ids.
-bool follows_rules(const Request& req) {
-  const std::vector<uint8_t>& b = req.body;
-  const size_t size = b.size();
-  const unsigned txn = req.header.txn_id;
-  if (size != req.header.msg_size) return false;
-  if (req.header.service == kServiceSmgr) {
-    switch (req.header.msg_id) {
-      case kMsgSmgrReport:
-        return size == kReportRequestSize && txn == kTxnReport;
-      case kMsgSmgrStatus:
-        return size == 3 && txn == kTxnStatus;
-      case kMsgSmgrSingleSensorTest:
-        return size == sizeof(single_sensor_test_request) && txn == kTxnSingleSensorTest &&
-               b[1] == 0;
-      case kMsgSmgrCalReset:
-        return size == 3 && txn == kTxnSingleSensorTest;
-      case kMsgSmgrSensorState:
-        return size == 1 && txn == kTxnSensorState && b[0] == 0xAA;
-      default:
-        return false;
+const TestWords* test_words(uint8_t sensor, int32_t test_type, bool calibration) {
+  for (const TestWords& row : kTestWords) {
+    if (row.sensor == sensor && (row.test_type == kAnyTest || row.test_type == test_type) &&
+        (row.options == Options::kAny || calibration)) {
+      return &row;
     }
   }
-  return req.header.service == kServiceDaf && req.header.msg_id == kMsgDafRequest &&
-         size == sizeof(daf_request) &&
-         (txn == kTxnMotor || txn == kTxnDaf ||
-          (txn >= kTxnThreshold && txn <= kTxnRegisterDumpLast)) &&
-         b[offsetof(daf_request, flag)] == 1 && b[offsetof(daf_request, trailing_flag)] == 0 &&
-         load_u32(b.data(), offsetof(daf_request, data_length)) <= kDafDataMax;
+  return nullptr;
 }
+
+struct TestName {
+  int32_t test_type;
+  const char* name;
+};
+const TestName kTestNames[] = {
+    {kTestTypeOther, "test"},
+    {kTestTypeSelftest, "self test"},
+    {kTestTypeFuseRom, "fuse ROM read"},
+    {kTestTypeRegisters, "register read"},
+    {kTestTypeLpfOn, "low-pass filter on"},
+    {kTestTypeLpfOff, "low-pass filter off"},
+    {kTestTypeGyroTemperature, "temperature"},
+};
 
 const char* test_name(int32_t test_type, bool calibration) {
   if (calibration) return "calibration";
-  switch (test_type) {
-    case 3:
-      return "test";
-    case 6:
-      return "self test";
-    case 9:
-      return "fuse ROM read";
-    case 10:
-      return "register read";
-    case 11:
-      return "low-pass filter on";
-    case 12:
-      return "low-pass filter off";
-    case 13:
-      return "temperature";
-    default:
-      return "test";
+  for (const TestName& row : kTestNames) {
+    if (row.test_type == test_type) return row.name;
   }
+  return "test";
 }
 
-const char* daf_name(uint32_t id) {
-  switch (id) {
-    case kDafLightStreamStart:
-      return "light polling start";
-    case kDafLightStreamStop:
-      return "light polling stop";
-    case kDafLightShortStart:
-      return "short light polling start";
-    case kDafLightShortStop:
-      return "short light polling stop";
-    case kDafMotorEnabled:
-      return "motor enabled";
-    case kDafMotorDisabled:
-      return "motor disabled";
-    case kDafRegisterDump:
-      return "register dump";
-    case kDafHiddenHole:
-      return "hidden-hole coefficients";
-    case 100006:
-    case 100007:
-      return "thresholds";
-    case 100008:
-    case 100009:
-      return "hidden-hole thresholds";
-    default:
-      return id >= kDafBigdataFirst && id < kDafHiddenHole ? "bulk data" : "driver request";
+// The driver requests by daf_request_id: the first row whose range holds the id.
+enum class DafAction { kNone, kStartPolling, kStopPolling, kRegisterDump };
+struct DafKind {
+  uint32_t first;
+  uint32_t last;
+  const char* name;
+  DafAction action;
+  uint8_t code;               // indication code of the polling started or stopped
+  daf_thresholds thresholds;  // words of the response
+};
+const DafKind kDafKinds[] = {
+    {kDafLightStreamStart,
+     kDafLightStreamStart,
+     "light polling start",
+     DafAction::kStartPolling,
+     kDafIndAlsRgb,
+     {}},
+    {kDafLightStreamStop,
+     kDafLightStreamStop,
+     "light polling stop",
+     DafAction::kStopPolling,
+     kDafIndAlsRgb,
+     {}},
+    {kDafLightShortStart,
+     kDafLightShortStart,
+     "short light polling start",
+     DafAction::kStartPolling,
+     kDafIndShort,
+     {}},
+    {kDafLightShortStop,
+     kDafLightShortStop,
+     "short light polling stop",
+     DafAction::kStopPolling,
+     kDafIndShort,
+     {}},
+    {kDafMotorEnabled, kDafMotorEnabled, "motor enabled", DafAction::kNone, 0, {}},
+    {kDafMotorDisabled, kDafMotorDisabled, "motor disabled", DafAction::kNone, 0, {}},
+    {kDafRegisterDump, kDafRegisterDump, "register dump", DafAction::kRegisterDump, 0, {}},
+    {kDafHiddenHole, kDafHiddenHole, "hidden-hole coefficients", DafAction::kNone, 0, {}},
+    {kDafThresholdFirst, kDafThresholdLast, "thresholds", DafAction::kNone, 0, {2600, 1800, 0, 0}},
+    {kDafHdThresholdFirst,
+     kDafHdThresholdLast,
+     "hidden-hole thresholds",
+     DafAction::kNone,
+     0,
+     {0, 0, 3100, 2300}},
+    {kDafBigdataFirst, kDafHiddenHole - 1, "bulk data", DafAction::kNone, 0, {}},
+};
+const DafKind kOtherDaf = {0, UINT32_MAX, "driver request", DafAction::kNone, 0, {}};
+
+const DafKind& daf_kind(uint32_t id) {
+  for (const DafKind& row : kDafKinds) {
+    if (id >= row.first && id <= row.last) return row;
   }
+  return kOtherDaf;
 }
 
-bool is_calibration(const std::vector<uint8_t>& body) {
-  return byte_at(body, 8) == 1 && byte_at(body, 9) == 1 && byte_at(body, 10) == 1 &&
-         byte_at(body, 11) == 1;
+// The rules of each request beyond its size: its transaction id and the fixed bytes.
+bool report_rule(const Request& req) {
+  return req.header.txn_id == kTxnReport;
+}
+
+bool status_rule(const Request& req) {
+  return req.header.txn_id == kTxnStatus;
+}
+
+bool test_rule(const Request& req) {
+  return req.header.txn_id == kTxnSingleSensorTest &&
+         record_of<single_sensor_test_request>(req.body).data_type == 0;
+}
+
+bool cal_reset_rule(const Request& req) {
+  return req.header.txn_id == kTxnCalReset;
+}
+
+bool sensor_state_rule(const Request& req) {
+  return req.header.txn_id == kTxnSensorState &&
+         record_of<sensor_state_request>(req.body).magic == kSensorStateMagic;
+}
+
+bool daf_rule(const Request& req) {
+  const unsigned txn = req.header.txn_id;
+  const daf_request r = record_of<daf_request>(req.body);
+  return (txn == kTxnMotor || txn == kTxnDaf ||
+          (txn >= kTxnThreshold && txn <= kTxnRegisterDumpLast)) &&
+         r.flag == 1 && r.trailing_flag == 0 && r.data_length <= kDafDataMax;
+}
+
+// What each request says, for the program's trace.
+std::string describe_sensor_state(const Body&) {
+  return "sensor states";
+}
+
+std::string describe_status(const Body& b) {
+  return format("status SensorID %u", record_of<status_request>(b).sensor_id);
+}
+
+std::string describe_cal_reset(const Body& b) {
+  return format("calibration reset SensorID %u", record_of<cal_reset_request>(b).sensor_id);
+}
+
+std::string describe_test(const Body& b) {
+  const auto r = record_of<single_sensor_test_request>(b);
+  const int32_t test_type = static_cast<int32_t>(r.test_type);
+  return format("%s SensorID %u TestType %d", test_name(test_type, is_calibration(r)), r.sensor_id,
+                test_type);
+}
+
+std::string describe_report(const Body& b) {
+  const auto r = record_of<report_request>(b);
+  if (r.action != kReportActionAdd) return format("report %u stop", r.report_id);
+  return format("report %u start SensorID %u at %u Hz", r.report_id, r.item_sensor_id,
+                r.report_rate);
+}
+
+std::string describe_daf(const Body& b) {
+  const uint32_t id = record_of<daf_request>(b).daf_request_id;
+  return format("%s (daf %u)", daf_kind(id).name, id);
+}
+
+}  // namespace
+
+struct HealthyPhone::MessageKind {
+  uint32_t service;
+  int32_t msg_id;
+  size_t size;  // of the body, exactly
+  bool (*rule)(const Request&);
+  void (HealthyPhone::*answer)(const Request&, const PhoneKnobs&);
+  std::string (*describe)(const Body&);
+};
+
+const HealthyPhone::MessageKind HealthyPhone::kMessages[] = {
+    {kServiceSmgr, kMsgSmgrReport, sizeof(report_request), report_rule,
+     &HealthyPhone::answer_report, describe_report},
+    {kServiceSmgr, kMsgSmgrStatus, sizeof(status_request), status_rule,
+     &HealthyPhone::answer_status, describe_status},
+    {kServiceSmgr, kMsgSmgrSingleSensorTest, sizeof(single_sensor_test_request), test_rule,
+     &HealthyPhone::answer_test, describe_test},
+    {kServiceSmgr, kMsgSmgrCalReset, sizeof(cal_reset_request), cal_reset_rule,
+     &HealthyPhone::answer_plain, describe_cal_reset},
+    {kServiceSmgr, kMsgSmgrSensorState, sizeof(sensor_state_request), sensor_state_rule,
+     &HealthyPhone::answer_sensor_state, describe_sensor_state},
+    {kServiceDaf, kMsgDafRequest, sizeof(daf_request), daf_rule, &HealthyPhone::answer_daf,
+     describe_daf},
+};
+
+const HealthyPhone::MessageKind* HealthyPhone::message_kind(const Header& header) {
+  for (const MessageKind& kind : kMessages) {
+    if (kind.service == header.service && kind.msg_id == header.msg_id) return &kind;
+  }
+  return nullptr;
+}
+
+namespace {
+
+// The rules of the requests the daemon writes: a kind the table knows, its exact size and the
+// kind's own rule.
+bool follows_rules(const Request& req) {
+  const HealthyPhone::MessageKind* kind = HealthyPhone::message_kind(req.header);
+  return req.body.size() == req.header.msg_size && kind != nullptr &&
+         req.body.size() == kind->size && kind->rule(req);
 }
 
 }  // namespace
@@ -280,6 +292,11 @@ HealthyPhone::HealthyPhone(Simulator& sim) : sim_(sim) {}
 void HealthyPhone::set_knobs(const PhoneKnobs& knobs) {
   std::lock_guard<std::mutex> lock(mu_);
   knobs_ = knobs;
+}
+
+PhoneKnobs HealthyPhone::knobs() const {
+  std::lock_guard<std::mutex> lock(mu_);
+  return knobs_;
 }
 
 void HealthyPhone::set_single_samples(bool single) {
@@ -313,143 +330,118 @@ void HealthyPhone::check(const Request& req) {
   }
 }
 
-std::vector<uint8_t> HealthyPhone::response(size_t size) const {
-  std::lock_guard<std::mutex> lock(mu_);
-  return knobs_.failed_responses ? common_response_body(1, 3, size)
-                                 : common_response_body(0, 0, size);
-}
-
 HealthyPhone::~HealthyPhone() {
   stop();
 }
 
+namespace {
+
+common_response common_of(const PhoneKnobs& knobs) {
+  return knobs.failed_responses ? common_response{1, 3} : common_response{0, 0};
+}
+
+}  // namespace
+
 void HealthyPhone::answer(const Request& req) {
   check(req);
-  PhoneKnobs knobs;
-  {
-    std::lock_guard<std::mutex> lock(mu_);
-    knobs = knobs_;
+  const PhoneKnobs now = knobs();
+  const MessageKind* kind = message_kind(req.header);
+  if (kind != nullptr) {
+    (this->*kind->answer)(req, now);
+  } else {
+    answer_plain(req, now);
   }
+}
+
+void HealthyPhone::respond(const Request& req, const std::vector<uint8_t>& body) {
+  sim_.respond_to(req.connection, {req.header.service, req.header.msg_id, 0, req.header.txn_id},
+                  body);
+}
+
+void HealthyPhone::indicate_test(const Request& req, const PhoneKnobs& knobs, uint8_t sensor,
+                                 int32_t test_type, const std::vector<int32_t>& words) {
+  if (knobs.no_indications) return;
   const bool failed = knobs.outcome != TestOutcome::kPassed;
   const bool with_code = knobs.outcome == TestOutcome::kFailedWithCode;
-  const std::vector<uint8_t>& body = req.body;
-  const Header resp{req.header.service, req.header.msg_id, 0, req.header.txn_id};
-  const int conn = req.connection;
+  sim_.indicate_to(
+      req.connection, {kServiceSmgr, kMsgSmgrSingleSensorTest, 0, req.header.txn_id},
+      test_indication_body(sensor, test_type, failed, with_code, with_code ? 7 : 0, words));
+}
 
-  if (req.header.service == kServiceSmgr) {
-    switch (req.header.msg_id) {
-      case kMsgSmgrSensorState: {
-        std::vector<uint8_t> table = response(kSensorStateResponseSize);
-        fill_sensor_state_table(&table);
-        sim_.respond_to(conn, resp, table);
-        return;
-      }
-      case kMsgSmgrStatus: {
-        sim_.respond_to(conn, resp, response(3));
-        const uint8_t id = byte_at(body, 0);
-        // A sensor that answers its status poll reports a finished test of type 3.
-        if (known_test_sensor(id) && !knobs.no_indications) {
-          sim_.indicate_to(conn, {kServiceSmgr, kMsgSmgrSingleSensorTest, 0, req.header.txn_id},
-                           test_indication_body(id, 3, failed, with_code, with_code ? 7 : 0, {}));
-        }
-        return;
-      }
-      case kMsgSmgrSingleSensorTest: {
-        sim_.respond_to(conn, resp, response(2));
-        const uint8_t id = byte_at(body, 0);
-        const int32_t test_type = static_cast<int32_t>(u32_at(body, 4));
-        const auto words = test_words(id, test_type, is_calibration(body));
-        if (words && !knobs.no_indications) {
-          sim_.indicate_to(
-              conn, {kServiceSmgr, kMsgSmgrSingleSensorTest, 0, req.header.txn_id},
-              test_indication_body(id, test_type, failed, with_code, with_code ? 7 : 0, *words));
-        }
-        return;
-      }
-      case kMsgSmgrReport: {
-        const uint8_t report_id = byte_at(body, kReportIdOffset);
-        const uint8_t action = byte_at(body, kReportActionOffset);
-        uint8_t sensor = byte_at(body, kReportItemOffset);
-        if (action == kReportActionAdd) {
-          int rate = u16_at(body, kReportRateOffset);
-          if (rate <= 0) rate = kDefaultRateHz;
-          rate = std::min(rate, kMaxRateHz);
-          Stream s;
-          s.connection = conn;
-          s.service = kServiceSmgr;
-          s.key = report_id;
-          s.sensor = sensor;
-          s.period = std::chrono::microseconds(1000000 / rate);
-          // Samples follow the response that accepted the report.
-          std::vector<uint8_t> r = response(kReportResponseSize);
-          r[kReportRespSensorIdOffset] = sensor;
-          sim_.respond_to(conn, resp, r);
-          if (!knobs.no_indications) start_stream(s);
-          return;
-        } else if (action == kReportActionDelete) {
-          // The delete request names only the report; the answer names its sensor.
-          {
-            std::lock_guard<std::mutex> lock(mu_);
-            for (const Stream& s : streams_) {
-              if (s.connection == conn && s.service == kServiceSmgr && s.key == report_id) {
-                sensor = s.sensor;
-              }
-            }
-          }
-          stop_stream(conn, kServiceSmgr, report_id);
-        }
-        // A stopped stream sends nothing after this response.
-        std::vector<uint8_t> r = response(kReportResponseSize);
-        r[kReportRespSensorIdOffset] = sensor;
-        sim_.respond_to(conn, resp, r);
-        return;
-      }
-      default:
-        break;
-    }
-  } else if (req.header.service == kServiceDaf && req.header.msg_id == kMsgDafRequest) {
-    const uint32_t id = u32_at(body, offsetof(daf_request, daf_request_id));
-    std::vector<uint8_t> r = response(kDafResponseSize);
+void HealthyPhone::answer_plain(const Request& req, const PhoneKnobs& knobs) {
+  const common_response c = common_of(knobs);
+  respond(req, common_response_body(c.result, c.error));
+}
+
+void HealthyPhone::answer_sensor_state(const Request& req, const PhoneKnobs& knobs) {
+  respond(req, sensor_state_body(common_of(knobs)));
+}
+
+void HealthyPhone::answer_status(const Request& req, const PhoneKnobs& knobs) {
+  const common_response c = common_of(knobs);
+  respond(req, common_response_body(c.result, c.error, kStatusResponseSize));
+  // A sensor that answers its status poll reports a finished test of type 3.
+  const uint8_t id = record_of<status_request>(req.body).sensor_id;
+  if (test_words(id, kTestTypeOther, false) != nullptr) {
+    indicate_test(req, knobs, id, kTestTypeOther, {});
+  }
+}
+
+void HealthyPhone::answer_test(const Request& req, const PhoneKnobs& knobs) {
+  answer_plain(req, knobs);
+  const auto r = record_of<single_sensor_test_request>(req.body);
+  const int32_t test_type = static_cast<int32_t>(r.test_type);
+  const TestWords* row = test_words(r.sensor_id, test_type, is_calibration(r));
+  if (row != nullptr) indicate_test(req, knobs, r.sensor_id, test_type, row->words);
+}
+
+void HealthyPhone::answer_report(const Request& req, const PhoneKnobs& knobs) {
+  const auto r = record_of<report_request>(req.body);
+  const int conn = req.connection;
+  uint8_t sensor = r.item_sensor_id;
+  if (r.action == kReportActionAdd) {
+    const int rate = std::min(r.report_rate == 0 ? kDefaultRateHz : int{r.report_rate}, kMaxRateHz);
     Stream s;
     s.connection = conn;
-    s.service = kServiceDaf;
-    s.period = std::chrono::microseconds(1000000 / kLightPollingHz);
-    switch (id) {
-      case kDafLightStreamStart:
-        s.key = kDafIndAlsRgb;
-        break;
-      case kDafLightStreamStop:
-        stop_stream(conn, kServiceDaf, kDafIndAlsRgb);
-        break;
-      case kDafLightShortStart:
-        s.key = kDafIndShort;
-        break;
-      case kDafLightShortStop:
-        stop_stream(conn, kServiceDaf, kDafIndShort);
-        break;
-      case kDafRegisterDump: {
-        const std::vector<uint8_t> regs = register_dump(req.header.txn_id);
-        std::copy(regs.begin(), regs.end(), r.begin() + kDafRespRegistersOffset);
-        break;
-      }
-      case 100006:
-      case 100007:
-        store_i32(r.data(), kDafRespHighOffset, 2600);
-        store_i32(r.data(), kDafRespLowOffset, 1800);
-        break;
-      case 100008:
-      case 100009:
-        store_i32(r.data(), kDafRespHdHighOffset, 3100);
-        store_i32(r.data(), kDafRespHdLowOffset, 2300);
-        break;
-      default:
-        break;
-    }
-    sim_.respond_to(conn, resp, r);
-    if (s.key != 0 && !knobs.no_indications) start_stream(s);  // results follow the response
+    s.service = kServiceSmgr;
+    s.key = r.report_id;
+    s.sensor = sensor;
+    s.period = std::chrono::microseconds(1000000 / rate);
+    // Samples follow the response that accepted the report.
+    respond(req, report_response_body(common_of(knobs), sensor));
+    if (!knobs.no_indications) start_stream(s);
     return;
   }
-  sim_.respond_to(conn, resp, response(2));
+  if (r.action == kReportActionDelete) {
+    // The delete request names only the report; the answer names its sensor.
+    {
+      std::lock_guard<std::mutex> lock(mu_);
+      for (const Stream& s : streams_) {
+        if (s.connection == conn && s.service == kServiceSmgr && s.key == r.report_id) {
+          sensor = s.sensor;
+        }
+      }
+    }
+    stop_stream(conn, kServiceSmgr, r.report_id);
+  }
+  // A stopped stream sends nothing after this response.
+  respond(req, report_response_body(common_of(knobs), sensor));
+}
+
+void HealthyPhone::answer_daf(const Request& req, const PhoneKnobs& knobs) {
+  const DafKind& kind = daf_kind(record_of<daf_request>(req.body).daf_request_id);
+  if (kind.action == DafAction::kStopPolling) stop_stream(req.connection, kServiceDaf, kind.code);
+  respond(req, kind.action == DafAction::kRegisterDump
+                   ? register_dump_body(common_of(knobs), req.header.txn_id)
+                   : daf_thresholds_body(common_of(knobs), kind.thresholds));
+  if (kind.action != DafAction::kStartPolling || knobs.no_indications) return;
+  // The results follow the response.
+  Stream s;
+  s.connection = req.connection;
+  s.service = kServiceDaf;
+  s.key = kind.code;
+  s.period = std::chrono::microseconds(1000000 / kLightPollingHz);
+  start_stream(s);
 }
 
 void HealthyPhone::start_stream(const Stream& stream) {
@@ -611,48 +603,11 @@ void HealthyPhone::run_streams() {
 }
 
 std::string describe_request(const Request& req) {
-  const std::vector<uint8_t>& b = req.body;
-  char what[160] = "";
-  if (req.header.service == kServiceSmgr) {
-    switch (req.header.msg_id) {
-      case kMsgSmgrSensorState:
-        snprintf(what, sizeof what, "sensor states");
-        break;
-      case kMsgSmgrStatus:
-        snprintf(what, sizeof what, "status SensorID %u", byte_at(b, 0));
-        break;
-      case kMsgSmgrCalReset:
-        snprintf(what, sizeof what, "calibration reset SensorID %u", byte_at(b, 1));
-        break;
-      case kMsgSmgrSingleSensorTest: {
-        const int32_t test_type = static_cast<int32_t>(u32_at(b, 4));
-        snprintf(what, sizeof what, "%s SensorID %u TestType %d",
-                 test_name(test_type, is_calibration(b)), byte_at(b, 0), test_type);
-        break;
-      }
-      case kMsgSmgrReport:
-        if (byte_at(b, kReportActionOffset) == kReportActionAdd) {
-          snprintf(what, sizeof what, "report %u start SensorID %u at %u Hz",
-                   byte_at(b, kReportIdOffset), byte_at(b, kReportItemOffset),
-                   u16_at(b, kReportRateOffset));
-        } else {
-          snprintf(what, sizeof what, "report %u stop", byte_at(b, kReportIdOffset));
-        }
-        break;
-      default:
-        snprintf(what, sizeof what, "unknown request");
-        break;
-    }
-  } else if (req.header.service == kServiceDaf && req.header.msg_id == kMsgDafRequest) {
-    const uint32_t id = u32_at(b, offsetof(daf_request, daf_request_id));
-    snprintf(what, sizeof what, "%s (daf %u)", daf_name(id), id);
-  } else {
-    snprintf(what, sizeof what, "unknown request");
-  }
-  char line[256];
-  snprintf(line, sizeof line, "svc %u msg %d txn %u size %zu: %s", req.header.service,
-           req.header.msg_id, req.header.txn_id, b.size(), what);
-  return line;
+  const HealthyPhone::MessageKind* kind = HealthyPhone::message_kind(req.header);
+  const std::string what = kind != nullptr ? kind->describe(req.body) : "unknown request";
+  return format("svc %u msg %d txn %u size %zu: ", req.header.service, req.header.msg_id,
+                req.header.txn_id, req.body.size()) +
+         what;
 }
 
 }  // namespace kestrel_sim

@@ -61,7 +61,25 @@ class HealthyPhone {
   // Requests that broke the rules, over the phone's life.
   uint64_t bad_requests() const;
 
+  // One row of the phone table: a kind of request (service, message id) with its body size, its
+  // rule, its answer and its description. Null for a request the daemon never writes.
+  struct MessageKind;
+  static const MessageKind* message_kind(const Header& header);
+
  private:
+  static const MessageKind kMessages[];
+
+  // The answers of the phone table, one per kind of request.
+  void answer_sensor_state(const Request& request, const PhoneKnobs& knobs);
+  void answer_status(const Request& request, const PhoneKnobs& knobs);
+  void answer_test(const Request& request, const PhoneKnobs& knobs);
+  void answer_plain(const Request& request, const PhoneKnobs& knobs);
+  void answer_report(const Request& request, const PhoneKnobs& knobs);
+  void answer_daf(const Request& request, const PhoneKnobs& knobs);
+  void respond(const Request& request, const std::vector<uint8_t>& body);
+  void indicate_test(const Request& request, const PhoneKnobs& knobs, uint8_t sensor,
+                     int32_t test_type, const std::vector<int32_t>& words);
+
   struct Stream {
     uint64_t id = 0;  // unique over the phone's life
     int connection = 0;
@@ -97,7 +115,7 @@ class HealthyPhone {
   uint64_t bad_requests_ = 0;
 
   void check(const Request& request);
-  std::vector<uint8_t> response(size_t size) const;
+  PhoneKnobs knobs() const;
 };
 
 // One readable line about a request, e.g.

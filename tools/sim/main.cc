@@ -11,6 +11,7 @@
 #include <atomic>
 #include <chrono>
 #include <mutex>
+#include <optional>
 #include <string>
 
 #include "tools/sim/healthy_phone.h"
@@ -54,15 +55,17 @@ void print_line(const std::string& line) {
   fflush(stdout);
 }
 
-}  // namespace
-
-int main(int argc, char** argv) {
-  const char* env_socket = getenv("KESTREL_SENSOR1_SOCKET");
-  std::string socket_path =
-      env_socket != nullptr && env_socket[0] != '\0' ? env_socket : kDefaultSocket;
+struct Options {
+  std::string socket_path;
   bool quiet = false;
-  long drop_after = -1;
+  long drop_after = -1;  // seconds; -1: never
   long refuse = 0;
+};
+
+// Parses the command line into options; an exit status when the program is to stop at once.
+std::optional<int> parse_options(int argc, char** argv, Options* opt) {
+  const char* env_socket = getenv("KESTREL_SENSOR1_SOCKET");
+  opt->socket_path = env_socket != nullptr && env_socket[0] != '\0' ? env_socket : kDefaultSocket;
   for (int i = 1; i < argc; ++i) {
     const std::string arg = argv[i];
     const bool has_value = i + 1 < argc;
@@ -70,12 +73,14 @@ int main(int argc, char** argv) {
       usage(stdout);
       return 0;
     } else if (arg == "--quiet" || arg == "-q") {
-      quiet = true;
+      opt->quiet = true;
     } else if (arg == "--socket" && has_value) {
-      socket_path = argv[++i];
-    } else if (arg == "--drop-after" && has_value && parse_count(argv[i + 1], 86400, &drop_after)) {
+      opt->socket_path = argv[++i];
+    } else if (arg == "--drop-after" && has_value &&
+               parse_count(argv[i + 1], 86400, &opt->drop_after)) {
       ++i;
-    } else if (arg == "--refuse-opens" && has_value && parse_count(argv[i + 1], 1000000, &refuse)) {
+    } else if (arg == "--refuse-opens" && has_value &&
+               parse_count(argv[i + 1], 1000000, &opt->refuse)) {
       ++i;
     } else {
       fprintf(stderr, "kestrel-sim: bad argument '%s'\n", arg.c_str());
@@ -83,6 +88,60 @@ int main(int argc, char** argv) {
       return 2;
     }
   }
+  return std::nullopt;
+}
+
+// When the first connection opened, for --drop-after. It outlives the simulator, whose hooks
+// write it.
+struct FirstOpen {
+  std::atomic<bool> seen{false};
+  std::chrono::steady_clock::time_point at;
+};
+
+// The trace lines of the program, and the time of the first open.
+void watch(kestrel_sim::Simulator& sim, const Options& opt, FirstOpen* first) {
+  const bool quiet = opt.quiet;
+  sim.set_connection_hook([=](kestrel_sim::Simulator&, int connection, bool opened) {
+    if (!quiet) {
+      print_line("connection " + std::to_string(connection) + (opened ? " opened" : " ended"));
+    }
+    if (opened && !first->seen.load()) {
+      first->at = std::chrono::steady_clock::now();
+      first->seen.store(true);
+    }
+  });
+  if (quiet) return;
+  sim.set_request_hook([](kestrel_sim::Simulator&, const kestrel_sim::Request& r) {
+    print_line("request " + kestrel_sim::describe_request(r));
+  });
+  print_line("kestrel-sim: serving " + opt.socket_path + " as a healthy phone");
+}
+
+// Serves until SIGINT or SIGTERM, dropping the first connection once when --drop-after says so.
+void serve(kestrel_sim::Simulator& sim, const Options& opt, const sigset_t& stop_signals,
+           FirstOpen* first) {
+  watch(sim, opt, first);
+  bool dropped = false;
+  for (;;) {
+    const timespec tick = {0, 100 * 1000 * 1000};
+    const int sig = sigtimedwait(&stop_signals, nullptr, &tick);
+    if (sig == SIGINT || sig == SIGTERM) break;
+    if (opt.drop_after < 0 || dropped || !first->seen.load()) continue;
+    if (std::chrono::steady_clock::now() - first->at >= std::chrono::seconds(opt.drop_after)) {
+      dropped = true;
+      if (!opt.quiet) {
+        print_line("dropping connection " + std::to_string(sim.current_connection()));
+      }
+      sim.drop_connection();
+    }
+  }
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  Options opt;
+  if (const std::optional<int> status = parse_options(argc, argv, &opt)) return *status;
 
   // The signals are taken synchronously below; every thread the simulator starts inherits the
   // mask, so none of them is interrupted.
@@ -93,40 +152,11 @@ int main(int argc, char** argv) {
   pthread_sigmask(SIG_BLOCK, &stop_signals, nullptr);
   signal(SIGPIPE, SIG_IGN);
 
-  kestrel_sim::Simulator sim(socket_path, true);
+  FirstOpen first;
+  kestrel_sim::Simulator sim(opt.socket_path, true);
   if (!sim.listening()) return 1;
-  if (refuse > 0) sim.refuse_opens(11, static_cast<int>(refuse));
-  // The first open starts the --drop-after clock.
-  std::atomic<bool> first_open_seen{false};
-  std::chrono::steady_clock::time_point first_open;
-  sim.set_connection_hook([&](kestrel_sim::Simulator&, int connection, bool opened) {
-    if (!quiet) {
-      print_line("connection " + std::to_string(connection) + (opened ? " opened" : " ended"));
-    }
-    if (opened && !first_open_seen.load()) {
-      first_open = std::chrono::steady_clock::now();
-      first_open_seen.store(true);
-    }
-  });
-  if (!quiet) {
-    sim.set_request_hook([](kestrel_sim::Simulator&, const kestrel_sim::Request& r) {
-      print_line("request " + kestrel_sim::describe_request(r));
-    });
-    print_line("kestrel-sim: serving " + socket_path + " as a healthy phone");
-  }
-
-  bool dropped = false;
-  for (;;) {
-    const timespec tick = {0, 100 * 1000 * 1000};
-    const int sig = sigtimedwait(&stop_signals, nullptr, &tick);
-    if (sig == SIGINT || sig == SIGTERM) break;
-    if (drop_after < 0 || dropped || !first_open_seen.load()) continue;
-    if (std::chrono::steady_clock::now() - first_open >= std::chrono::seconds(drop_after)) {
-      dropped = true;
-      if (!quiet) print_line("dropping connection " + std::to_string(sim.current_connection()));
-      sim.drop_connection();
-    }
-  }
-  if (!quiet) print_line("kestrel-sim: stopped");
+  if (opt.refuse > 0) sim.refuse_opens(11, static_cast<int>(opt.refuse));
+  serve(sim, opt, stop_signals, &first);
+  if (!opt.quiet) print_line("kestrel-sim: stopped");
   return 0;
 }

@@ -15,6 +15,7 @@
 #include <vector>
 
 #include "sensor1_wire.h"
+#include "tools/sim/phone_bodies.h"  // the bodies tests send through the simulator
 
 namespace kestrel_sim {
 
@@ -126,19 +127,5 @@ class Simulator {
   struct State;
   std::unique_ptr<State> state_;
 };
-
-// Bodies of the sensor service, as the daemon reads them. Shared by the healthy phone and tests.
-// A single-sensor test indication (84 bytes): words go to offsets 20, 24, ... (at most 16).
-std::vector<uint8_t> test_indication_body(uint8_t sensor_id, int32_t test_type, uint32_t result,
-                                          uint8_t error_valid, uint8_t error_code,
-                                          const std::vector<int32_t>& words);
-// A sample indication (24 bytes).
-std::vector<uint8_t> sample_indication_body(uint8_t sensor_id, uint8_t data_type, int32_t x,
-                                            int32_t y, int32_t z);
-// A daf_indication (32 bytes).
-std::vector<uint8_t> daf_indication_body(uint8_t code, uint8_t valid, uint32_t length,
-                                         const std::array<int32_t, 6>& data);
-// A response of the common form: result, error, then zeros up to size bytes.
-std::vector<uint8_t> common_response_body(uint8_t result, uint8_t error, size_t size = 2);
 
 }  // namespace kestrel_sim

@@ -15,7 +15,6 @@
 //     for it at the start.
 // A failing run prints its seed and the command that replays it.
 #include <linux/netlink.h>
-#include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -37,7 +36,11 @@
 #include "kernel_port.h"
 #include "tools/sim/chaos_phone.h"
 #include "tools/sim/simulator.h"
+#include "tools/soak/command_cycle.h"
 #include "tools/soak/daemon_driver.h"
+#include "tools/soak/proc_readings.h"
+#include "tools/soak/tool_main.h"
+#include "tools/soak/verdicts.h"
 
 #ifndef KESTRELD_BINARY
 #error "KESTRELD_BINARY names the daemon"
@@ -45,7 +48,7 @@
 
 namespace {
 
-using namespace kestrel_soak;
+using namespace kestrel_driver;
 using Clock = std::chrono::steady_clock;
 using Millis = std::chrono::milliseconds;
 using namespace std::chrono_literals;
@@ -75,93 +78,72 @@ struct Options {
   std::string replay;
 };
 
-void usage(FILE* out) {
-  fprintf(
-      out,
-      "usage: kestrel-chaos [options]   (run it in a network namespace of its own)\n"
-      "  --minutes X         length of the chaos (default 5)\n"
-      "  --seed N            seed of the schedule (default 1)\n"
-      "  --time-scale X      KESTREL_TIME_SCALE of the daemon (default 0.05)\n"
-      "  --margin-ms N       time beyond the scaled 8 s wait a command may take (default 1000)\n"
-      "  --registry FILE     sensors registry (the probe's answer comes from it)\n"
-      "  --daemon PATH       the daemon (default: the one built beside this program)\n"
-      "  --replay TEXT       the command that replays this run, printed when it fails\n");
-}
-
 bool parse_options(int argc, char** argv, Options* o) {
-  for (int i = 1; i < argc; i += 2) {
-    const std::string a = argv[i];
-    const char* v = i + 1 < argc ? argv[i + 1] : nullptr;
-    if (v == nullptr && a != "--help") {
-      usage(stderr);
-      return false;
-    }
-    if (a == "--minutes") {
-      o->minutes = atof(v);
-    } else if (a == "--seed") {
-      o->seed = strtoull(v, nullptr, 10);
-    } else if (a == "--time-scale") {
-      o->time_scale = atof(v);
-    } else if (a == "--margin-ms") {
-      o->margin_ms = atol(v);
-    } else if (a == "--idle-threads") {
-      o->idle_threads = atoi(v);
-    } else if (a == "--memory-slack-kb") {
-      o->memory_slack_kb = atol(v);
-    } else if (a == "--registry") {
-      o->registry = v;
-    } else if (a == "--daemon") {
-      o->daemon = v;
-    } else if (a == "--replay") {
-      o->replay = v;
-    } else if (a == "--help") {
-      usage(stdout);
-      exit(0);
-    } else {
-      usage(stderr);
-      return false;
-    }
-  }
-  return o->minutes >= 0 && o->time_scale > 0 && o->margin_ms >= 0;
-}
-
-// The command number of a command frame, or the type of a frame from the daemon.
-uint16_t command_of(const std::vector<uint8_t>& datagram) {
-  return static_cast<uint16_t>(datagram[4] | datagram[5] << 8);
+  const std::vector<ToolOption> options = {
+      {"--minutes", "X", "length of the chaos (default 5)",
+       [o](const char* v) { o->minutes = atof(v); }},
+      {"--seed", "N", "seed of the schedule (default 1)",
+       [o](const char* v) { o->seed = strtoull(v, nullptr, 10); }},
+      {"--time-scale", "X", "KESTREL_TIME_SCALE of the daemon (default 0.05)",
+       [o](const char* v) { o->time_scale = atof(v); }},
+      {"--margin-ms", "N", "time beyond the scaled 8 s wait a command may take (default 1000)",
+       [o](const char* v) { o->margin_ms = atol(v); }},
+      {"--idle-threads", "N", "threads of an idle daemon (default 2)",
+       [o](const char* v) { o->idle_threads = atoi(v); }},
+      {"--memory-slack-kb", "N", "private memory a daemon may gain (default 64; -1: any)",
+       [o](const char* v) { o->memory_slack_kb = atol(v); }},
+      {"--registry", "FILE", "sensors registry (the probe's answer comes from it)",
+       [o](const char* v) { o->registry = v; }},
+      {"--daemon", "PATH", "the daemon (default: the one built beside this program)",
+       [o](const char* v) { o->daemon = v; }},
+      {"--replay", "TEXT", "the command that replays this run, printed when it fails",
+       [o](const char* v) { o->replay = v; }},
+  };
+  return parse_tool_options(
+             argc, argv,
+             "usage: kestrel-chaos [options]   (run it in a network namespace of its own)",
+             options) &&
+         o->minutes >= 0 && o->time_scale > 0 && o->margin_ms >= 0;
 }
 
 class Chaos {
  public:
-  explicit Chaos(const Options& o) : o_(o) {}
+  explicit Chaos(const Options& o)
+      : o_(o), dir_("kestrel-chaos"), log_(dir_.file("kestreld.log"), {"on a closed handle"}) {}
   int run();
 
  private:
+  bool open();
   bool start_daemon_and_wait();
-  bool daemon_ended();
-  void join_log_reader();
+  bool daemon_ended() { return daemon_->wait_exit(0ms, &exit_status_); }
   void receive_frames();
+  void chaos(std::vector<std::vector<uint8_t>>* reference,
+             std::vector<std::vector<uint8_t>>* final_frames);
+  bool one_command(std::mt19937_64* rng);
+  void end();
+  void print_figures();
+  void check_sessions(const std::vector<std::vector<uint8_t>>& reference,
+                      const std::vector<std::vector<uint8_t>>& final_frames);
   // Sends datagram and a probe; true once the probe's reply came within timeout.
   bool send_and_probe(const std::vector<uint8_t>& datagram, Millis timeout);
-  bool settle(Usage* usage);
+  bool settle(ProcessStatus* usage);
   bool checkpoint(const char* when);
   bool healthy_session(std::vector<std::vector<uint8_t>>* frames);
   bool specified_exit();
-  bool check(bool ok, const std::string& what);
+  bool check(bool ok, const std::string& what) { return verdicts_.check(ok, what); }
   void fail(const std::string& what);
 
   const Options& o_;
-  std::string dir_;
+  RunDir dir_;
+  DaemonLog log_;
   std::unique_ptr<kestrel_sim::Simulator> sim_;
   std::unique_ptr<kestrel_sim::ChaosPhone> phone_;
   kestrelctl::KernelPort rx_, tx_;
   std::thread receiver_;
   std::atomic<bool> stop_{false};
 
-  pid_t pid_ = -1;
-  bool exited_ = false;
+  std::unique_ptr<ChildProcess> daemon_;
   int exit_status_ = 0;
-  LogTally log_;
-  std::thread log_reader_;
 
   std::mutex mu_;  // guards what follows, with cv_
   std::condition_variable cv_;
@@ -177,38 +159,18 @@ class Chaos {
   long checkpoints_ = 0;
   double slowest_ms_ = 0;
   uint16_t slowest_command_ = 0;
+  Millis bound_{0};
   pid_t baseline_pid_ = -1;
-  Usage baseline_, last_;
-  bool ok_ = true;
+  ProcessStatus baseline_, last_;
+  Verdicts verdicts_{"chaos", 66};
 };
 
-bool Chaos::check(bool ok, const std::string& what) {
-  printf("chaos: %-66s %s\n", what.c_str(), ok ? "ok" : "MISS");
-  if (!ok) ok_ = false;
-  return ok;
-}
-
 void Chaos::fail(const std::string& what) {
-  ok_ = false;
+  verdicts_.miss();
   fprintf(stderr, "chaos: FAILED: %s\n", what.c_str());
-  {
-    std::lock_guard<std::mutex> lock(log_.mu);
-    fprintf(stderr, "chaos: the daemon's last log lines:\n");
-    for (const std::string& l : log_.last) {
-      if (!l.empty()) fprintf(stderr, "  %s\n", l.c_str());
-    }
-  }
+  log_.print_last("chaos");
   fprintf(stderr, "chaos: seed %llu; replay with: %s\n", static_cast<unsigned long long>(o_.seed),
           o_.replay.empty() ? "(not given)" : o_.replay.c_str());
-}
-
-bool Chaos::daemon_ended() {
-  if (!exited_) exited_ = wait_exit(pid_, 0ms, &exit_status_);
-  return exited_;
-}
-
-void Chaos::join_log_reader() {
-  if (log_reader_.joinable()) log_reader_.join();
 }
 
 void Chaos::receive_frames() {
@@ -242,32 +204,23 @@ bool Chaos::send_and_probe(const std::vector<uint8_t>& datagram, Millis timeout)
 }
 
 bool Chaos::start_daemon_and_wait() {
-  const std::map<std::string, std::string> env =
-      daemon_environment(dir_, sim_->socket_path(), o_.time_scale, o_.registry);
   const int opened = sim_->opened_connections();
-  int log_fd = -1;
-  exited_ = false;
-  pid_ = start_daemon({o_.daemon}, env, &log_fd);
-  if (pid_ < 0) {
-    fail("cannot start " + o_.daemon);
-    return false;
-  }
-  log_reader_ = std::thread(read_log, log_fd, &log_);
+  daemon_ = std::make_unique<ChildProcess>(
+      std::vector<std::string>{o_.daemon},
+      daemon_environment(dir_, sim_->socket_path(), o_.time_scale, o_.registry), log_.path());
   // Up: the start-up thread has opened the service and both start-up threads have ended.
-  const auto ready_by = Clock::now() + 60s;
-  while (!(sim_->opened_connections() > opened && usage_of(pid_).threads == o_.idle_threads)) {
-    if (daemon_ended() || Clock::now() >= ready_by) {
-      fail("the daemon did not come up");
-      return false;
-    }
-    std::this_thread::sleep_for(10ms);
+  if (!wait_up(
+          daemon_.get(), [&] { return sim_->opened_connections() > opened; }, o_.idle_threads,
+          60s)) {
+    fail("the daemon did not come up");
+    return false;
   }
   return true;
 }
 
 // The link rebuilt without faults, nothing late still to come, no answer left flagged, the
 // daemon's passing threads ended.
-bool Chaos::settle(Usage* usage) {
+bool Chaos::settle(ProcessStatus* usage) {
   phone_->enable(false);
   const Millis timeout(8000 + o_.margin_ms * 4);
   auto deadline = Clock::now() + timeout;
@@ -286,40 +239,39 @@ bool Chaos::settle(Usage* usage) {
   // the daemon's scaled pauses (a link's rebuilding on the library's thread included).
   deadline = Clock::now() + timeout;
   for (;;) {
-    long lines;
-    {
-      std::lock_guard<std::mutex> lock(log_.mu);
-      lines = log_.lines;
-    }
+    log_.update();
+    const long lines = log_.lines();
     std::this_thread::sleep_for(kQuiet);
-    *usage = usage_of(pid_);
-    std::lock_guard<std::mutex> lock(log_.mu);
-    if (usage->threads == o_.idle_threads && log_.lines == lines) return true;
+    *usage = process_status(daemon_->pid());
+    log_.update();
+    if (usage->threads == o_.idle_threads && log_.lines() == lines) return true;
     if (daemon_ended() || Clock::now() >= deadline) return false;
   }
 }
 
 bool Chaos::checkpoint(const char* when) {
-  Usage u;
+  ProcessStatus u;
   if (!settle(&u)) {
     if (!specified_exit()) fail(std::string("the daemon did not settle ") + when);
     return false;
   }
   ++checkpoints_;
   last_ = u;
+  const pid_t pid = daemon_->pid();
   printf(
-      "chaos: %-9s %5ld commands, %4ld exits; pid %d: rss %ld kB (anon %ld), %d fds, %d threads\n",
-      when, commands_, exits_, pid_, u.rss_kb, u.anon_kb, u.descriptors, u.threads);
+      "chaos: %-9s %5ld commands, %4ld exits; pid %d: rss %ld kB (anon %ld), %ld fds, %ld "
+      "threads\n",
+      when, commands_, exits_, pid, u.rss_kib, u.rss_anon_kib, u.descriptors, u.threads);
   // Memory used the first time a path runs (a thread's malloc arena, for one) is no growth: the
   // first checkpoint under chaos is the daemon's baseline.
   if (strcmp(when, "start") == 0) return true;
-  if (baseline_pid_ != pid_) {
-    baseline_pid_ = pid_;
+  if (baseline_pid_ != pid) {
+    baseline_pid_ = pid;
     baseline_ = u;
     return true;
   }
   if (u.descriptors != baseline_.descriptors || u.threads != baseline_.threads ||
-      (o_.memory_slack_kb >= 0 && u.anon_kb > baseline_.anon_kb + o_.memory_slack_kb)) {
+      (o_.memory_slack_kb >= 0 && u.rss_anon_kib > baseline_.rss_anon_kib + o_.memory_slack_kb)) {
     fail(std::string("resources grew ") + when);
     return false;
   }
@@ -365,13 +317,8 @@ bool Chaos::specified_exit() {
   const auto deadline = Clock::now() + 2s;
   while (!daemon_ended() && Clock::now() < deadline) std::this_thread::sleep_for(10ms);
   if (!daemon_ended()) return false;
-  join_log_reader();
-  bool logged = false;
-  {
-    std::lock_guard<std::mutex> lock(log_.mu);
-    const std::string line = "sensor1_close returned " + std::to_string(kCloseStatus);
-    for (const std::string& l : log_.last) logged = logged || l.find(line) != std::string::npos;
-  }
+  log_.update();
+  const bool logged = log_.recent("sensor1_close returned " + std::to_string(kCloseStatus));
   if (exit_status_ != kCloseStatus || !logged) {
     fail("the daemon ended with status " + std::to_string(exit_status_));
     return false;
@@ -385,13 +332,12 @@ bool Chaos::specified_exit() {
   return start_daemon_and_wait();
 }
 
-int Chaos::run() {
-  dir_ = make_run_dir("kestrel-chaos");
-  if (dir_.empty()) {
+bool Chaos::open() {
+  if (!dir_.ok()) {
     fprintf(stderr, "chaos: cannot create a temporary directory\n");
-    return 2;
+    return false;
   }
-  sim_ = std::make_unique<kestrel_sim::Simulator>(dir_ + "/sensor1.sock", false);
+  sim_ = std::make_unique<kestrel_sim::Simulator>(dir_.file("sensor1.sock"), false);
   kestrel_sim::ChaosSettings settings;
   settings.seed = o_.seed;
   settings.time_scale = o_.time_scale;
@@ -400,64 +346,72 @@ int Chaos::run() {
   std::string error;
   if (!sim_->listening() || !rx_.open_bound(kKernelPort, &error) || !tx_.open_unbound(&error)) {
     fprintf(stderr, "chaos: cannot open the sockets (run it in a network namespace of its own)\n");
-    return 2;
+    return false;
   }
   receiver_ = std::thread([this] { receive_frames(); });
-  const long wait_ms = static_cast<long>(8000 * o_.time_scale);
-  const Millis bound(wait_ms + o_.margin_ms);
-  printf("chaos: %s, seed %llu, %g minutes, time scale %g, every command done within %ld ms\n",
-         o_.daemon.c_str(), static_cast<unsigned long long>(o_.seed), o_.minutes, o_.time_scale,
-         static_cast<long>(bound.count()));
+  return true;
+}
 
-  std::vector<std::vector<uint8_t>> reference, final_frames;
-  bool reference_ok = false, final_ok = false;
-  if (start_daemon_and_wait() && checkpoint("start")) {
-    reference_ok = healthy_session(&reference);
-    std::mt19937_64 rng(o_.seed * 0x2545f4914f6cdd1dull + 1);
-    const auto started = Clock::now();
-    const auto end = started + std::chrono::duration_cast<Clock::duration>(
-                                   std::chrono::duration<double>(o_.minutes * 60));
-    const auto every = std::max<Clock::duration>(
-        std::chrono::duration_cast<Clock::duration>((end - started) / 10), 10s);
-    auto next_checkpoint = started + every;
+// One command of a random kind, and its probe. False when the run must stop.
+bool Chaos::one_command(std::mt19937_64* rng) {
+  const std::vector<Planned> kinds = cycle(static_cast<long>((*rng)() % 1000));
+  const Planned& p = kinds[(*rng)() % kinds.size()];
+  const uint16_t command = command_of(p.datagram);
+  const auto sent = Clock::now();
+  const bool done = send_and_probe(p.datagram, bound_);
+  const double ms = std::chrono::duration<double, std::milli>(Clock::now() - sent).count();
+  ++commands_;
+  if (done) {
+    if (p.reply >= 0) ++waiting_commands_;
+    if (ms > slowest_ms_) std::tie(slowest_ms_, slowest_command_) = std::pair(ms, command);
+  } else if (!specified_exit()) {
+    if (verdicts_.ok()) fail("command " + std::to_string(command) + " not done within its wait");
+    return false;
+  } else {
     phone_->enable(true);
-    while (ok_ && Clock::now() < end) {
-      if (Clock::now() >= next_checkpoint) {
-        if (!checkpoint("chaos") && !ok_) break;
-        phone_->enable(true);
-        next_checkpoint = Clock::now() + every;
-      }
-      const std::vector<Planned> kinds = cycle(static_cast<long>(rng() % 1000));
-      const Planned& p = kinds[rng() % kinds.size()];
-      const uint16_t command = command_of(p.datagram);
-      const auto sent = Clock::now();
-      const bool done = send_and_probe(p.datagram, bound);
-      const double ms = std::chrono::duration<double, std::milli>(Clock::now() - sent).count();
-      ++commands_;
-      if (done) {
-        if (p.reply >= 0) ++waiting_commands_;
-        if (ms > slowest_ms_) std::tie(slowest_ms_, slowest_command_) = std::pair(ms, command);
-      } else if (!specified_exit()) {
-        if (ok_) fail("command " + std::to_string(command) + " not done within its wait");
-        break;
-      } else {
-        phone_->enable(true);
-      }
-      std::this_thread::sleep_for(std::chrono::microseconds(rng() % 10000));
+  }
+  std::this_thread::sleep_for(std::chrono::microseconds((*rng)() % 10000));
+  return true;
+}
+
+// A healthy session, the faults and commands with a checkpoint every tenth of the time, and a
+// healthy session again.
+void Chaos::chaos(std::vector<std::vector<uint8_t>>* reference,
+                  std::vector<std::vector<uint8_t>>* final_frames) {
+  if (!start_daemon_and_wait() || !checkpoint("start")) return;
+  const bool reference_ok = healthy_session(reference);
+  std::mt19937_64 rng(o_.seed * 0x2545f4914f6cdd1dull + 1);
+  const auto started = Clock::now();
+  const auto end = started + std::chrono::duration_cast<Clock::duration>(
+                                 std::chrono::duration<double>(o_.minutes * 60));
+  const auto every = std::max<Clock::duration>(
+      std::chrono::duration_cast<Clock::duration>((end - started) / 10), 10s);
+  auto next_checkpoint = started + every;
+  phone_->enable(true);
+  while (verdicts_.ok() && Clock::now() < end) {
+    if (Clock::now() >= next_checkpoint) {
+      if (!checkpoint("chaos") && !verdicts_.ok()) break;
+      phone_->enable(true);
+      next_checkpoint = Clock::now() + every;
     }
-    phone_->enable(false);
-    if (ok_ && checkpoint("end")) final_ok = healthy_session(&final_frames);
+    if (!one_command(&rng)) break;
   }
-  const auto injected = phone_->injected();
-  phone_.reset();
-  if (pid_ > 0 && !daemon_ended()) {
-    kill(pid_, SIGKILL);
-    while (!daemon_ended()) std::this_thread::sleep_for(10ms);
-  }
-  join_log_reader();
+  phone_->enable(false);
+  const bool final_ok = verdicts_.ok() && checkpoint("end") && healthy_session(final_frames);
+  if (!reference_ok || !final_ok) final_frames->clear();
+}
+
+// The phone's faults stopped, the daemon and the receiver ended.
+void Chaos::end() {
+  phone_->enable(false);
+  if (daemon_) daemon_->kill_and_reap();
+  log_.update();
   stop_ = true;
   receiver_.join();
+}
 
+void Chaos::print_figures() {
+  const auto injected = phone_->injected();
   printf("chaos: faults injected:");
   long faults = 0;
   for (size_t k = 0; k < kestrel_sim::kChaosFaultKinds; ++k) {
@@ -470,43 +424,53 @@ int Chaos::run() {
       "(command %u), %ld exits with the close's result and restarts, %ld checkpoints\n",
       faults, commands_, waiting_commands_, slowest_ms_, unsigned{slowest_command_}, exits_,
       checkpoints_);
-  printf("chaos: first checkpoint of pid %d: rss %ld kB (anon %ld), %d fds, %d threads\n",
-         baseline_pid_, baseline_.rss_kb, baseline_.anon_kb, baseline_.descriptors,
+  printf("chaos: first checkpoint of pid %d: rss %ld kB (anon %ld), %ld fds, %ld threads\n",
+         baseline_pid_, baseline_.rss_kib, baseline_.rss_anon_kib, baseline_.descriptors,
          baseline_.threads);
-  printf("chaos: last checkpoint:          rss %ld kB (anon %ld), %d fds, %d threads\n",
-         last_.rss_kb, last_.anon_kb, last_.descriptors, last_.threads);
+  printf("chaos: last checkpoint:          rss %ld kB (anon %ld), %ld fds, %ld threads\n",
+         last_.rss_kib, last_.rss_anon_kib, last_.descriptors, last_.threads);
   if (overruns_ > 0) printf("chaos: the kernel port's queue overflowed %ld times\n", overruns_);
-  check(ok_, "the daemon ended only with the close's result, and settled each time");
-  check(log_.seen["on a closed handle"] == 0, "no sensor1 call on a closed handle");
-  check(faults > 0 && commands_ > 0 && slowest_ms_ <= static_cast<double>(bound.count()),
+  check(verdicts_.ok(), "the daemon ended only with the close's result, and settled each time");
+  check(log_.seen("on a closed handle") == 0, "no sensor1 call on a closed handle");
+  check(faults > 0 && commands_ > 0 && slowest_ms_ <= static_cast<double>(bound_.count()),
         "every command done within the scaled wait and the margin");
-  check(reference_ok && final_ok && !reference.empty() && final_frames == reference,
+}
+
+void Chaos::check_sessions(const std::vector<std::vector<uint8_t>>& reference,
+                           const std::vector<std::vector<uint8_t>>& final_frames) {
+  check(!reference.empty() && final_frames == reference,
         "a healthy session after the chaos: the frames of a fresh daemon, byte for byte");
-  if (final_frames != reference) {
-    printf("chaos: %zu frames at the start, %zu at the end\n", reference.size(),
-           final_frames.size());
-    for (size_t i = 0; i < std::max(reference.size(), final_frames.size()); ++i) {
-      const std::string a = i < reference.size() ? kestrelctl::to_hex(reference[i]) : "-";
-      const std::string b = i < final_frames.size() ? kestrelctl::to_hex(final_frames[i]) : "-";
-      if (a != b) printf("chaos: frame %zu: %s / %s\n", i, a.c_str(), b.c_str());
-    }
+  if (final_frames == reference) return;
+  printf("chaos: %zu frames at the start, %zu at the end\n", reference.size(), final_frames.size());
+  for (size_t i = 0; i < std::max(reference.size(), final_frames.size()); ++i) {
+    const std::string a = i < reference.size() ? kestrelctl::to_hex(reference[i]) : "-";
+    const std::string b = i < final_frames.size() ? kestrelctl::to_hex(final_frames[i]) : "-";
+    if (a != b) printf("chaos: frame %zu: %s / %s\n", i, a.c_str(), b.c_str());
   }
-  printf("chaos: %s\n", ok_ ? "PASS" : "FAIL");
-  if (!ok_) {
+}
+
+int Chaos::run() {
+  if (!open()) return 2;
+  bound_ = Millis(static_cast<long>(8000 * o_.time_scale) + o_.margin_ms);
+  printf("chaos: %s, seed %llu, %g minutes, time scale %g, every command done within %ld ms\n",
+         o_.daemon.c_str(), static_cast<unsigned long long>(o_.seed), o_.minutes, o_.time_scale,
+         static_cast<long>(bound_.count()));
+  std::vector<std::vector<uint8_t>> reference, final_frames;
+  chaos(&reference, &final_frames);
+  end();
+  print_figures();
+  check_sessions(reference, final_frames);
+  const int status = verdicts_.finish();
+  if (status != 0) {
     fprintf(stderr, "chaos: seed %llu; replay with: %s\n", static_cast<unsigned long long>(o_.seed),
             o_.replay.empty() ? "(not given)" : o_.replay.c_str());
-  } else {
-    remove_run_dir(dir_);
+    dir_.keep();
   }
-  return ok_ ? 0 : 1;
+  return status;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  Options o;
-  if (!parse_options(argc, argv, &o)) return 2;
-  signal(SIGPIPE, SIG_IGN);
-  setvbuf(stdout, nullptr, _IOLBF, 0);
-  return Chaos(o).run();
+  return kestrel_driver::tool_main<Chaos>(argc, argv, parse_options);
 }

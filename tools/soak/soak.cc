@@ -11,39 +11,32 @@
 // The run ends through the daemon's own exit path: a write failure whose close fails makes it
 // exit with the close's result, which valgrind --error-exitcode=1 replaces by 1 when it found
 // errors. The figures go to stdout; the exit status is 0 when every check held.
-#include <dirent.h>
-#include <errno.h>
-#include <fcntl.h>
-#include <linux/netlink.h>
-#include <poll.h>
-#include <signal.h>
+#include <ctype.h>
 #include <stdio.h>
 #include <stdlib.h>
-#include <string.h>
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
 
 #include <algorithm>
 #include <array>
 #include <atomic>
 #include <chrono>
-#include <deque>
 #include <fstream>
-#include <map>
+#include <functional>
 #include <memory>
-#include <mutex>
 #include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
 
-#include "byte_order.h"
 #include "frame_codec.h"
+#include "frame_decoder.h"
 #include "kernel_frame.h"
+#include "kernel_port.h"
 #include "tools/sim/simulator.h"
+#include "tools/soak/command_cycle.h"
 #include "tools/soak/daemon_driver.h"
+#include "tools/soak/proc_readings.h"
+#include "tools/soak/tool_main.h"
+#include "tools/soak/verdicts.h"
 
 #ifndef KESTRELD_BINARY
 #error "KESTRELD_BINARY names the daemon to soak"
@@ -51,7 +44,7 @@
 
 namespace {
 
-using namespace kestrel_soak;
+using namespace kestrel_driver;
 
 using Clock = std::chrono::steady_clock;
 using namespace std::chrono_literals;
@@ -62,6 +55,20 @@ constexpr long kInjectWindow = 2000;
 // The injected sample: a gyroscope reading the daemon turns into {-61, 61, -30}.
 constexpr uint8_t kInjectSensor = 10;
 constexpr int32_t kInjectX = 1000, kInjectY = -1000, kInjectZ = 500;
+constexpr char kInjectedValues[] = "[-61,61,-30,";
+// The daemon's log lines counted: failures, and an indication that came before its waiter.
+constexpr char kEarlyCallback[] = "cb has arrived without waiting";
+const std::vector<std::string> kLogPatterns = {
+    kEarlyCallback,
+    "ERROR: No response for command",
+    "sensor1_write -error",
+    "sensor1_write error",
+    "alloc_msg_buf error",
+    "get_raw error",
+    "BROKEN_PIPE",
+    "malformed",
+    "refused",
+};
 
 struct Options {
   long indications = 1000000;
@@ -76,53 +83,30 @@ struct Options {
   std::string valgrind_log;
 };
 
-void usage(FILE* out) {
-  fprintf(out,
-          "usage: kestrel-soak [options]   (run it in a network namespace of its own)\n"
-          "  --indications N     sample indications to feed (default 1000000)\n"
-          "  --commands N        kernel commands to send (default 100000)\n"
-          "  --time-scale X      KESTREL_TIME_SCALE of the daemon (default 0.05)\n"
-          "  --registry FILE     sensors registry for command 4 (default: none)\n"
-          "  --daemon PATH       the daemon (default: the one built beside this program)\n"
-          "  --valgrind          run the daemon under valgrind memcheck\n"
-          "  --suppressions FILE valgrind suppressions\n"
-          "  --valgrind-log FILE where valgrind writes (default: a temporary file)\n");
-}
-
 bool parse_options(int argc, char** argv, Options* o) {
-  for (int i = 1; i < argc; ++i) {
-    const std::string a = argv[i];
-    auto value = [&](const char** out) {
-      if (i + 1 >= argc) return false;
-      *out = argv[++i];
-      return true;
-    };
-    const char* v = nullptr;
-    if (a == "--indications" && value(&v)) {
-      o->indications = atol(v);
-    } else if (a == "--commands" && value(&v)) {
-      o->commands = atol(v);
-    } else if (a == "--time-scale" && value(&v)) {
-      o->time_scale = atof(v);
-    } else if (a == "--registry" && value(&v)) {
-      o->registry = v;
-    } else if (a == "--daemon" && value(&v)) {
-      o->daemon = v;
-    } else if (a == "--valgrind") {
-      o->valgrind = true;
-    } else if (a == "--suppressions" && value(&v)) {
-      o->suppressions = v;
-    } else if (a == "--valgrind-log" && value(&v)) {
-      o->valgrind_log = v;
-    } else if (a == "--help") {
-      usage(stdout);
-      exit(0);
-    } else {
-      usage(stderr);
-      return false;
-    }
-  }
-  return o->indications >= 0 && o->commands >= 10 && o->time_scale > 0;
+  const std::vector<ToolOption> options = {
+      {"--indications", "N", "sample indications to feed (default 1000000)",
+       [o](const char* v) { o->indications = atol(v); }},
+      {"--commands", "N", "kernel commands to send (default 100000)",
+       [o](const char* v) { o->commands = atol(v); }},
+      {"--time-scale", "X", "KESTREL_TIME_SCALE of the daemon (default 0.05)",
+       [o](const char* v) { o->time_scale = atof(v); }},
+      {"--registry", "FILE", "sensors registry for command 4 (default: none)",
+       [o](const char* v) { o->registry = v; }},
+      {"--daemon", "PATH", "the daemon (default: the one built beside this program)",
+       [o](const char* v) { o->daemon = v; }},
+      {"--valgrind", nullptr, "run the daemon under valgrind memcheck",
+       [o](const char*) { o->valgrind = true; }},
+      {"--suppressions", "FILE", "valgrind suppressions",
+       [o](const char* v) { o->suppressions = v; }},
+      {"--valgrind-log", "FILE", "where valgrind writes (default: a temporary file)",
+       [o](const char* v) { o->valgrind_log = v; }},
+  };
+  return parse_tool_options(
+             argc, argv,
+             "usage: kestrel-soak [options]   (run it in a network namespace of its own)",
+             options) &&
+         o->indications >= 0 && o->commands >= 10 && o->time_scale > 0;
 }
 
 // The commands one after the other, cycle after cycle.
@@ -155,90 +139,48 @@ struct Tally {
   std::atomic<long> overruns{0};
 };
 
+// The field of each reply that tells whether the healthy phone answered, and its value then.
+struct AnsweredReply {
+  uint16_t type;
+  const char* field;
+  const char* answered;
+};
+constexpr AnsweredReply kAnsweredReplies[] = {
+    {FRAME_STATUS, "no_response", "0"},           {FRAME_STORE_CALIBRATION, "result", "0"},
+    {FRAME_MAG_FUSE_ROM, "result", "0"},          {FRAME_MAG_REGISTERS, "result", "0"},
+    {FRAME_SELFTEST, "verdict", "\"PASS\""},  // every healthy self test passes
+    {FRAME_GYRO_SELFTEST, "verdict", "\"PASS\""},
+};
+
+// The JSON value of a decoded field, "" when the frame has none.
+std::string field(const kestrelctl::DecodedFrame& d, const std::string& name) {
+  for (const kestrelctl::Field& f : d.fields) {
+    if (f.name == name && f.in_json) return f.json;
+  }
+  return "";
+}
+
+void count_sample(const kestrelctl::DecodedFrame& d, Tally* t) {
+  const std::string code = field(d, "code");
+  if (code == "1" && field(d, "values").rfind(kInjectedValues, 0) == 0) {
+    ++t->injected;
+  } else if (code == "0" || code == "4" || code == "5") {
+    ++t->stream;
+  } else {
+    ++t->odd_samples;
+  }
+}
+
 void count_frame(const kestrelctl::Frame& f, Tally* t) {
-  if (f.malformed) {
+  if (f.malformed || f.type >= t->frames.size()) {
     ++t->other;
     return;
   }
-  if (f.type < t->frames.size()) {
-    ++t->frames[f.type];
-  } else {
-    ++t->other;
-  }
-  const std::vector<uint8_t>& p = f.payload;
-  auto word = [&](size_t i) { return p.size() >= 4 * (i + 1) ? load_i32(p.data(), 4 * i) : 0; };
-  switch (f.type) {
-    case FRAME_SAMPLE: {
-      const int32_t code = word(0);
-      const int16_t v0 = p.size() >= 6 ? static_cast<int16_t>(load_u16(p.data(), 4)) : 0;
-      const int16_t v1 = p.size() >= 8 ? static_cast<int16_t>(load_u16(p.data(), 6)) : 0;
-      const int16_t v2 = p.size() >= 10 ? static_cast<int16_t>(load_u16(p.data(), 8)) : 0;
-      if (code == 1 && v0 == -61 && v1 == 61 && v2 == -30) {
-        ++t->injected;
-      } else if (code == 0 || code == 4 || code == 5) {
-        ++t->stream;
-      } else {
-        ++t->odd_samples;
-      }
-      break;
-    }
-    case FRAME_STATUS:
-      if (p.size() < 2 || p[1] != 0) ++t->unanswered;
-      break;
-    case FRAME_STORE_CALIBRATION:
-      if (word(1) != 0) ++t->unanswered;
-      break;
-    case FRAME_MAG_FUSE_ROM:
-    case FRAME_MAG_REGISTERS:
-      if (word(8) != 0) ++t->unanswered;
-      break;
-    case FRAME_SELFTEST:
-    case FRAME_GYRO_SELFTEST:
-      if (word(1) != 1) ++t->unanswered;  // every healthy self test passes
-      break;
-    default:
-      break;
-  }
-}
-
-int open_kernel_socket(uint32_t port) {
-  const int fd = socket(AF_NETLINK, SOCK_RAW | SOCK_CLOEXEC, NETLINK_USERSOCK);
-  if (fd < 0) return -1;
-  if (port != 0) {
-    int size = 8 << 20;
-    if (setsockopt(fd, SOL_SOCKET, SO_RCVBUFFORCE, &size, sizeof size) != 0) {
-      setsockopt(fd, SOL_SOCKET, SO_RCVBUF, &size, sizeof size);
-    }
-    struct sockaddr_nl addr = {};
-    addr.nl_family = AF_NETLINK;
-    addr.nl_pid = port;
-    if (bind(fd, reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) != 0) {
-      close(fd);
-      return -1;
-    }
-  }
-  return fd;
-}
-
-void receive_frames(int fd, const std::atomic<bool>* stop, Tally* t) {
-  std::vector<uint8_t> buf(65536);
-  while (!stop->load()) {
-    struct pollfd p = {fd, POLLIN, 0};
-    if (poll(&p, 1, 100) <= 0) continue;
-    for (;;) {
-      const ssize_t n = recv(fd, buf.data(), buf.size(), MSG_DONTWAIT);
-      if (n < 0) {
-        if (errno == ENOBUFS) {
-          ++t->overruns;
-          continue;
-        }
-        break;
-      }
-      for (const kestrelctl::Frame& f :
-           kestrelctl::split_frames(buf.data(), static_cast<size_t>(n))) {
-        count_frame(f, t);
-      }
-    }
+  ++t->frames[f.type];
+  const kestrelctl::DecodedFrame d = kestrelctl::decode_frame(f);
+  if (f.type == FRAME_SAMPLE) count_sample(d, t);
+  for (const AnsweredReply& r : kAnsweredReplies) {
+    if (r.type == f.type && field(d, r.field) != r.answered) ++t->unanswered;
   }
 }
 
@@ -293,78 +235,100 @@ ValgrindSummary read_valgrind_log(const std::string& path) {
   return s;
 }
 
+// The figures of valgrind's log and their checks.
+void check_valgrind(const std::string& log,
+                    const std::function<bool(bool, const std::string&)>& check) {
+  const ValgrindSummary v = read_valgrind_log(log);
+  printf(
+      "soak: valgrind: %ld errors (%ld suppressed); definitely lost %ld, indirectly lost %ld, "
+      "possibly lost %ld bytes; %ld bytes in suppressed leaks\n",
+      v.errors, v.suppressed_errors, v.definitely, v.indirectly, v.possibly, v.suppressed_leaks);
+  printf("soak: valgrind log: %s\n", log.c_str());
+  check(v.found && v.errors == 0, "valgrind: ERROR SUMMARY 0 errors");
+  check(v.definitely == 0 && v.indirectly == 0 && v.possibly == 0,
+        "valgrind: definitely, indirectly and possibly lost 0 bytes");
+}
+
+struct Figures {
+  ProcessStatus warm, end;
+  double seconds = 0;
+  int status = 0;
+  double rss_growth() const {
+    return warm.rss_kib > 0
+               ? static_cast<double>(end.rss_kib - warm.rss_kib) / static_cast<double>(warm.rss_kib)
+               : 1.0;
+  }
+};
+
 class Soak {
  public:
-  explicit Soak(const Options& o) : o_(o) {}
+  explicit Soak(const Options& o)
+      : o_(o), dir_("kestrel-soak"), log_(dir_.file("kestreld.log"), kLogPatterns) {
+    if (o_.valgrind && o_.valgrind_log.empty()) o_.valgrind_log = dir_.file("valgrind.log");
+  }
 
   int run();
 
  private:
-  bool prepare();
+  bool start();
+  bool work(Figures* f);
+  int end_through_exit_path();
+  void stop_receiving();
+  void receive_frames();
   void send_commands(long count);
   void inject(long from, long to);
   bool wait_quiet(std::chrono::seconds timeout);
-  bool daemon_ended();
+  bool daemon_ended() { return daemon_->wait_exit(0ms); }
   void report_failure(const std::string& what);
-  bool check(bool ok, const std::string& what);
+  bool check(bool ok, const std::string& what) { return verdicts_.check(ok, what); }
+  void print_figures(const Figures& f);
+  void check_figures(const Figures& f);
 
-  const Options& o_;
-  std::string dir_;
+  Options o_;
+  RunDir dir_;
+  DaemonLog log_;
   std::unique_ptr<kestrel_sim::Simulator> sim_;
-  int kernel_fd_ = -1;
-  int send_fd_ = -1;
-  pid_t pid_ = -1;
+  kestrelctl::KernelPort rx_, tx_;
+  std::unique_ptr<ChildProcess> daemon_;
+  std::thread receiver_;
+  std::atomic<bool> stop_{false};
   Tally tally_;
-  LogTally log_;
   CommandStream commands_;
   std::array<std::atomic<long>, 64> expected_{};
   std::atomic<long> injected_sent_{0};
   std::atomic<long> inject_failures_{0};
   std::atomic<long> send_failures_{0};
-  std::mutex exit_mu_;
-  bool exited_ = false;
-  int exit_status_ = 0;
-  bool ok_ = true;
+  Verdicts verdicts_{"soak", 62};
 };
-
-// True once the daemon has ended; its status is kept.
-bool Soak::daemon_ended() {
-  std::lock_guard<std::mutex> lock(exit_mu_);
-  if (!exited_) exited_ = wait_exit(pid_, 0ms, &exit_status_);
-  return exited_;
-}
-
-bool Soak::check(bool ok, const std::string& what) {
-  printf("soak: %-62s %s\n", what.c_str(), ok ? "ok" : "MISS");
-  if (!ok) ok_ = false;
-  return ok;
-}
 
 void Soak::report_failure(const std::string& what) {
   fprintf(stderr, "soak: %s\n", what.c_str());
-  std::lock_guard<std::mutex> lock(log_.mu);
-  fprintf(stderr, "soak: the daemon's last log lines:\n");
-  for (const std::string& l : log_.last) fprintf(stderr, "  %s\n", l.c_str());
-  ok_ = false;
+  log_.print_last("soak");
+  verdicts_.miss();
 }
 
-bool Soak::prepare() {
-  dir_ = make_run_dir("kestrel-soak");
-  return !dir_.empty();
+void Soak::receive_frames() {
+  std::vector<kestrelctl::Frame> frames;
+  while (!stop_.load()) {
+    frames.clear();
+    if (rx_.receive(100, &frames, nullptr) == kestrelctl::KernelPort::Wait::kOverrun) {
+      ++tally_.overruns;
+    }
+    for (const kestrelctl::Frame& f : frames) count_frame(f, &tally_);
+  }
+}
+
+void Soak::stop_receiving() {
+  stop_ = true;
+  if (receiver_.joinable()) receiver_.join();
 }
 
 void Soak::send_commands(long count) {
-  struct sockaddr_nl addr = {};
-  addr.nl_family = AF_NETLINK;
-  addr.nl_pid = kDaemonPort;
   for (long i = 0; i < count; ++i) {
     const Planned& p = commands_.next();
     if (p.reply >= 0) ++expected_[static_cast<size_t>(p.reply)];
     // Blocking: when the daemon's queue is full this waits for it.
-    if (sendto(send_fd_, p.datagram.data(), p.datagram.size(), 0,
-               reinterpret_cast<struct sockaddr*>(&addr), sizeof addr) < 0) {
-      ++send_failures_;
-    }
+    if (!tx_.send(p.datagram)) ++send_failures_;
   }
 }
 
@@ -402,193 +366,161 @@ bool Soak::wait_quiet(std::chrono::seconds timeout) {
   }
 }
 
-int Soak::run() {
-  if (!prepare()) {
-    fprintf(stderr, "soak: cannot create a temporary directory\n");
-    return 2;
-  }
-  const std::string socket_path = dir_ + "/sensor1.sock";
-  sim_ = std::make_unique<kestrel_sim::Simulator>(socket_path, true);
-  kernel_fd_ = open_kernel_socket(kKernelPort);
-  send_fd_ = open_kernel_socket(0);
-  if (!sim_->listening() || kernel_fd_ < 0 || send_fd_ < 0) {
+// The simulator, the kernel's ports and the daemon, until the daemon is ready.
+bool Soak::start() {
+  const std::string socket_path = dir_.file("sensor1.sock");
+  if (dir_.ok()) sim_ = std::make_unique<kestrel_sim::Simulator>(socket_path, true);
+  if (!dir_.ok() || !sim_->listening() || !rx_.open_bound(kKernelPort) || !tx_.open_unbound()) {
     fprintf(stderr, "soak: cannot open the sockets (run it in a network namespace of its own)\n");
-    return 2;
+    return false;
   }
-  std::atomic<bool> stop{false};
-  std::thread receiver(receive_frames, kernel_fd_, &stop, &tally_);
-
-  const std::map<std::string, std::string> env =
-      daemon_environment(dir_, socket_path, o_.time_scale, o_.registry);
-  char scale[32];
-  snprintf(scale, sizeof scale, "%g", o_.time_scale);
-  Options o = o_;
-  if (o.valgrind && o.valgrind_log.empty()) o.valgrind_log = dir_ + "/valgrind.log";
-
+  receiver_ = std::thread([this] { receive_frames(); });
   std::vector<std::string> args;
-  if (o.valgrind) {
-    args = {"valgrind", "--leak-check=full", "--error-exitcode=1", "--log-file=" + o.valgrind_log};
-    if (!o.suppressions.empty()) args.push_back("--suppressions=" + o.suppressions);
+  if (o_.valgrind) {
+    args = {"valgrind", "--leak-check=full", "--error-exitcode=1", "--log-file=" + o_.valgrind_log};
+    if (!o_.suppressions.empty()) args.push_back("--suppressions=" + o_.suppressions);
   }
-  args.push_back(o.daemon);
-  int log_fd = -1;
-  pid_ = start_daemon(args, env, &log_fd);
-  if (pid_ < 0) {
-    fprintf(stderr, "soak: cannot start %s\n", o.daemon.c_str());
-    return 2;
+  args.push_back(o_.daemon);
+  daemon_ = std::make_unique<ChildProcess>(
+      args, daemon_environment(dir_, socket_path, o_.time_scale, o_.registry), log_.path());
+  printf("soak: %s%s, %ld sample indications, %ld commands of %d kinds, time scale %g\n",
+         o_.valgrind ? "valgrind memcheck on " : "", o_.daemon.c_str(), o_.indications, o_.commands,
+         kCommandKinds, o_.time_scale);
+  // Up: the start-up thread has opened the service and both start-up threads have ended.
+  if (!wait_up(
+          daemon_.get(), [&] { return sim_->current_connection() != 0; }, 2,
+          o_.valgrind ? 120s : 30s)) {
+    report_failure("the daemon did not come up");
+    return false;
   }
-  std::thread log_reader(read_log, log_fd, &log_);
+  return true;
+}
 
-  printf("soak: %s%s, %ld sample indications, %ld commands of %d kinds, time scale %s\n",
-         o.valgrind ? "valgrind memcheck on " : "", o.daemon.c_str(), o.indications, o.commands,
-         kCommandKinds, scale);
-  fflush(stdout);
+// The warm-up, then the rest, the daemon's resources read after each.
+bool Soak::work(Figures* f) {
   const auto started = Clock::now();
-  // Ready: the start-up thread has opened the service and both start-up threads have ended.
-  const auto ready_by = Clock::now() + (o.valgrind ? 120s : 30s);
-  while (!(sim_->current_connection() != 0 && usage_of(pid_).threads == 2)) {
-    if (daemon_ended() || Clock::now() >= ready_by) {
-      report_failure("the daemon did not come up");
-      kill(pid_, SIGKILL);
-      stop = true;
-      receiver.join();
-      log_reader.join();
-      return 1;
-    }
-    std::this_thread::sleep_for(20ms);
-  }
-
-  const long warm_commands = static_cast<long>(static_cast<double>(o.commands) * o.warmup);
-  const long warm_indications = static_cast<long>(static_cast<double>(o.indications) * o.warmup);
-  Usage warm, end;
+  const long warm_commands = static_cast<long>(static_cast<double>(o_.commands) * o_.warmup);
+  const long warm_indications = static_cast<long>(static_cast<double>(o_.indications) * o_.warmup);
   struct Phase {
     long commands_from, commands_to, indications_from, indications_to;
-    Usage* usage;
+    ProcessStatus* status;
     const char* name;
   };
   const Phase phases[] = {
-      {0, warm_commands, 0, warm_indications, &warm, "warm-up"},
-      {warm_commands, o.commands, warm_indications, o.indications, &end, "the rest"},
+      {0, warm_commands, 0, warm_indications, &f->warm, "warm-up"},
+      {warm_commands, o_.commands, warm_indications, o_.indications, &f->end, "the rest"},
   };
-  const std::chrono::seconds quiet_timeout = o.valgrind ? 1800s : 600s;
   for (const Phase& p : phases) {
     std::thread commands([&] { send_commands(p.commands_to - p.commands_from); });
     std::thread samples([&] { inject(p.indications_from, p.indications_to); });
     commands.join();
     samples.join();
-    if (!wait_quiet(quiet_timeout)) {
+    if (!wait_quiet(o_.valgrind ? 1800s : 600s)) {
       report_failure(std::string("frames still missing after ") + p.name);
-      break;
+      return false;
     }
-    *p.usage = usage_of(pid_);
+    *p.status = process_status(daemon_->pid());
   }
-  const double seconds = std::chrono::duration<double>(Clock::now() - started).count();
+  f->seconds = std::chrono::duration<double>(Clock::now() - started).count();
+  return true;
+}
 
-  // The end: the next write fails and so does the close, and the daemon exits with its result.
+// The end: the next write fails and so does the close, and the daemon exits with its result.
+int Soak::end_through_exit_path() {
   sim_->fault(kestrel_sim::FaultOp::kWrite, 5, 1, 60s);
   sim_->fault(kestrel_sim::FaultOp::kClose, kExitStatus, 1, 60s);
-  const std::vector<uint8_t> last = kestrelctl::build_command(27, {0, 2});
-  struct sockaddr_nl addr = {};
-  addr.nl_family = AF_NETLINK;
-  addr.nl_pid = kDaemonPort;
-  sendto(send_fd_, last.data(), last.size(), 0, reinterpret_cast<struct sockaddr*>(&addr),
-         sizeof addr);
-  const auto end_by = Clock::now() + (o.valgrind ? 600s : 60s);
-  while (!daemon_ended() && Clock::now() < end_by) std::this_thread::sleep_for(10ms);
-  if (!daemon_ended()) {
-    kill(pid_, SIGKILL);
-    while (!daemon_ended()) std::this_thread::sleep_for(10ms);
+  tx_.send(kestrelctl::build_command(27, {0, 2}));
+  int status = 0;
+  if (!daemon_->wait_exit(o_.valgrind ? 600s : 60s, &status)) {
+    daemon_->kill_and_reap();
     report_failure("the daemon did not end through its exit path");
   }
-  const int status = exit_status_;
-  log_reader.join();
-  stop = true;
-  receiver.join();
+  return status;
+}
 
-  // The figures.
+void Soak::print_figures(const Figures& f) {
   long replies = 0;
-  bool replies_match = true;
   for (size_t t = 0; t < expected_.size(); ++t) {
     if (t == FRAME_HH_REFRESH || t == FRAME_SAMPLE) continue;
     replies += tally_.frames[t];
     if (tally_.frames[t] != expected_[t]) {
       printf("soak: frame type %zu: %ld received, %ld expected\n", t, tally_.frames[t].load(),
              expected_[t].load());
-      replies_match = false;
     }
   }
-  printf("soak: %.1f s: %.0f sample indications/s, %.0f commands/s\n", seconds,
-         static_cast<double>(o.indications) / seconds, static_cast<double>(o.commands) / seconds);
+  printf("soak: %.1f s: %.0f sample indications/s, %.0f commands/s\n", f.seconds,
+         static_cast<double>(o_.indications) / f.seconds,
+         static_cast<double>(o_.commands) / f.seconds);
   printf("soak: frames: %ld injected samples, %ld stream samples, %ld replies, %ld refresh\n",
          tally_.injected.load(), tally_.stream.load(), replies,
          tally_.frames[FRAME_HH_REFRESH].load());
-  printf("soak: daemon log: %ld lines", log_.lines);
-  for (const auto& kv : log_.seen) printf("; \"%s\" %ld", kv.first.c_str(), kv.second);
+  printf("soak: daemon log: %ld lines", log_.lines());
+  for (const auto& kv : log_.seen()) printf("; \"%s\" %ld", kv.first.c_str(), kv.second);
   printf("\n");
-  const char* whose = o.valgrind ? " (valgrind's own memory included)" : "";
-  printf("soak: after warm-up: rss %ld kB (anon %ld, file %ld), %d descriptors, %d threads%s\n",
-         warm.rss_kb, warm.anon_kb, warm.file_kb, warm.descriptors, warm.threads, whose);
-  printf("soak: at the end:    rss %ld kB (anon %ld, file %ld), %d descriptors, %d threads%s\n",
-         end.rss_kb, end.anon_kb, end.file_kb, end.descriptors, end.threads, whose);
-  const double growth = warm.rss_kb > 0 ? static_cast<double>(end.rss_kb - warm.rss_kb) /
-                                              static_cast<double>(warm.rss_kb)
-                                        : 1.0;
-  printf("soak: rss change %+.2f%%\n", growth * 100.0);
+  const char* whose = o_.valgrind ? " (valgrind's own memory included)" : "";
+  for (const auto& [when, u] : {std::pair("after warm-up:", f.warm), {"at the end:   ", f.end}}) {
+    printf("soak: %s rss %ld kB (anon %ld, file %ld), %ld descriptors, %ld threads%s\n", when,
+           u.rss_kib, u.rss_anon_kib, u.rss_file_kib, u.descriptors, u.threads, whose);
+  }
+  printf("soak: rss change %+.2f%%\n", f.rss_growth() * 100.0);
+}
 
-  check(
-      tally_.injected == o.indications && injected_sent_ == o.indications && inject_failures_ == 0,
-      "every injected sample came back as one frame, unchanged");
+void Soak::check_figures(const Figures& f) {
+  bool replies_match = send_failures_ == 0;
+  for (size_t t = 0; t < expected_.size(); ++t) {
+    if (t != FRAME_HH_REFRESH && t != FRAME_SAMPLE) {
+      replies_match = replies_match && tally_.frames[t] == expected_[t];
+    }
+  }
+  check(tally_.injected == o_.indications && injected_sent_ == o_.indications &&
+            inject_failures_ == 0,
+        "every injected sample came back as one frame, unchanged");
   check(tally_.odd_samples == 0 && tally_.other == 0 && tally_.overruns == 0,
         "no unexpected or lost frames");
-  check(replies_match && send_failures_ == 0, "every command brought its reply frames");
+  check(replies_match, "every command brought its reply frames");
   check(tally_.unanswered == 0, "every reply reports an answer of the healthy phone");
-  {
-    std::lock_guard<std::mutex> lock(log_.mu);
-    long faults = 0;
-    for (const auto& kv : log_.seen) {
-      if (kv.first != "cb has arrived without waiting") faults += kv.second;
-    }
-    // The last command's write failure is the one expected fault line.
-    check(faults == 1 && log_.seen["sensor1_write -error"] == 1,
-          "no failure in the daemon's log but the final one");
-  }
-  if (!o.valgrind) {
-    check(warm.rss_kb > 0 && end.rss_kb > 0 && growth <= o.rss_tolerance &&
-              growth >= -o.rss_tolerance,
+  // The last command's write failure is the one expected fault line.
+  long faults = 0;
+  for (const auto& kv : log_.seen()) faults += kv.first != kEarlyCallback ? kv.second : 0;
+  check(faults == 1 && log_.seen("sensor1_write -error") == 1,
+        "no failure in the daemon's log but the final one");
+  const double growth = f.rss_growth();
+  if (!o_.valgrind) {
+    check(f.warm.rss_kib > 0 && f.end.rss_kib > 0 && growth <= o_.rss_tolerance &&
+              growth >= -o_.rss_tolerance,
           "resident memory at the end within 1% of after warm-up");
   }
-  check(warm.descriptors > 0 && end.descriptors == warm.descriptors, "no descriptor growth");
-  check(warm.threads > 0 && end.threads == warm.threads, "no thread growth");
-  if (o.valgrind) {
-    const ValgrindSummary v = read_valgrind_log(o.valgrind_log);
-    printf(
-        "soak: valgrind: %ld errors (%ld suppressed); definitely lost %ld, indirectly lost %ld, "
-        "possibly lost %ld bytes; %ld bytes in suppressed leaks\n",
-        v.errors, v.suppressed_errors, v.definitely, v.indirectly, v.possibly, v.suppressed_leaks);
-    printf("soak: valgrind log: %s\n", o.valgrind_log.c_str());
-    check(v.found && v.errors == 0, "valgrind: ERROR SUMMARY 0 errors");
-    check(v.definitely == 0 && v.indirectly == 0 && v.possibly == 0,
-          "valgrind: definitely, indirectly and possibly lost 0 bytes");
-    check(status == kExitStatus, "exit status " + std::to_string(status) +
-                                     ": the close's result, "
-                                     "not valgrind's error code");
-  } else {
-    check(status == kExitStatus, "exit status " + std::to_string(status) + ": the close's result");
+  check(f.warm.descriptors > 0 && f.end.descriptors == f.warm.descriptors, "no descriptor growth");
+  check(f.warm.threads > 0 && f.end.threads == f.warm.threads, "no thread growth");
+  if (o_.valgrind)
+    check_valgrind(o_.valgrind_log,
+                   [this](bool ok, const std::string& what) { return check(ok, what); });
+  check(f.status == kExitStatus, "exit status " + std::to_string(f.status) +
+                                     ": the close's result" +
+                                     (o_.valgrind ? ", not valgrind's error code" : ""));
+}
+
+int Soak::run() {
+  Figures f;
+  if (!start()) {
+    stop_receiving();
+    return verdicts_.ok() ? 2 : 1;
   }
-  printf("soak: %s\n", ok_ ? "PASS" : "FAIL");
-  if (!ok_) report_failure("the soak missed");
-  if (ok_ && o.valgrind_log.rfind(dir_, 0) != 0) {
-    remove_run_dir(dir_);
-  }
-  return ok_ ? 0 : 1;
+  work(&f);
+  f.status = end_through_exit_path();
+  stop_receiving();
+  log_.update();
+  print_figures(f);
+  check_figures(f);
+  const int status = verdicts_.finish();
+  if (status != 0) report_failure("the soak missed");
+  // A failed run leaves its files for a look; so does one whose valgrind log is among them.
+  if (status != 0 || o_.valgrind_log.rfind(dir_.path(), 0) == 0) dir_.keep();
+  return status;
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-  Options o;
-  if (!parse_options(argc, argv, &o)) return 2;
-  signal(SIGPIPE, SIG_IGN);
-  setvbuf(stdout, nullptr, _IOLBF, 0);
-  return Soak(o).run();
+  return kestrel_driver::tool_main<Soak>(argc, argv, parse_options);
 }
