@@ -138,7 +138,7 @@ int get_raw_data(const uint8_t* frame) {
       // A reset whose write failed has closed the connection the body was taken on: the report
       // is not written on the closed handle but taken anew, on the connection that opens next.
       if (req.handle != current_sensor1_handle()) {
-        sensor1_free_msg_buf(current_sensor1_handle(), req.body);
+        abandon_request(&req);
         if (!begin_report_request(&req, name, sensor_type)) return -1;
       }
     }

@@ -19,7 +19,9 @@ bool begin_request(sensor1_request* req, const char* name, int32_t handle_arg, u
   req->header.msg_size = size;
   req->header.txn_id = txn_id;
   req->body = nullptr;
-  const int r = sensor1_alloc_msg_buf(req->handle, size, &req->body);
+  sensor1_handle_s* lent = lend_handle(req->handle);
+  const int r = sensor1_alloc_msg_buf(lent, size, &req->body);
+  return_handle(lent);
   if (r != SENSOR1_SUCCESS || req->body == nullptr) {
     switch (text) {
       case alloc_failure_text::kBracketed:
@@ -40,20 +42,32 @@ bool begin_request(sensor1_request* req, const char* name, int32_t handle_arg, u
   return true;
 }
 
-int write_request(sensor1_request* req) {
-  const int r = sensor1_write(req->handle, &req->header, req->body);
-  if (r == SENSOR1_SUCCESS || r == SENSOR1_EWOULDBLOCK) return 0;
-  sensor1_free_msg_buf(req->handle, req->body);
-  req->body = nullptr;
+namespace {
+
+// The write, and on failure the release of the body, on the request's handle while it is still
+// the current one (else on the empty handle, as after a failed reopen).
+int write_or_free(sensor1_request* req) {
+  sensor1_handle_s* lent = lend_handle(req->handle);
+  int r = sensor1_write(lent, &req->header, req->body);
+  if (r == SENSOR1_EWOULDBLOCK) r = SENSOR1_SUCCESS;
+  if (r != SENSOR1_SUCCESS) {
+    sensor1_free_msg_buf(lent, req->body);
+    req->body = nullptr;
+  }
+  return_handle(lent);
   return r;
 }
 
+}  // namespace
+
+int write_request(sensor1_request* req) {
+  return write_or_free(req);
+}
+
 bool write_request_or_close(sensor1_request* req) {
-  const int r = sensor1_write(req->handle, &req->header, req->body);
-  if (r == SENSOR1_SUCCESS || r == SENSOR1_EWOULDBLOCK) return true;
+  const int r = write_or_free(req);
+  if (r == SENSOR1_SUCCESS) return true;
   KLOGE("[%s]sensor1_write -error  %d\n", req->name, r);
-  sensor1_free_msg_buf(req->handle, req->body);
-  req->body = nullptr;
   // The handle is emptied with the close, so the next request opens a new connection instead of
   // writing on a closed one.
   const int closed = close_and_forget_handle(req->handle);
@@ -71,7 +85,9 @@ int32_t wait_for_answer(const char* name) {
 }
 
 void abandon_request(sensor1_request* req) {
-  sensor1_free_msg_buf(req->handle, req->body);
+  sensor1_handle_s* lent = lend_handle(req->handle);
+  sensor1_free_msg_buf(lent, req->body);
+  return_handle(lent);
   req->body = nullptr;
 }
 

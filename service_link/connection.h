@@ -9,13 +9,9 @@
 constexpr int32_t kOpenRetryBudget = 50;
 
 // Returns the current handle, opening the connection first when it is empty and the budget
-// allows. sensor_type is only logged. The result may be null.
+// allows; an open in progress on another thread is waited for and its result taken. sensor_type
+// is only logged. The result may be null.
 sensor1_handle_s* get_handle_for_sensor(int32_t sensor_type);
-
-// The same, for the library's callback thread: an open in progress on another thread is not
-// waited for (the empty handle is returned), so that thread never waits on one that may itself be
-// waiting in sensor1_close for the callback to return.
-sensor1_handle_s* get_handle_without_waiting(int32_t sensor_type);
 
 // The current handle (null when empty), without opening anything.
 sensor1_handle_s* current_sensor1_handle();
@@ -24,13 +20,25 @@ sensor1_handle_s* current_sensor1_handle();
 // tests that call rcv_test_msg as the library does.
 intptr_t sensor1_callback_data();
 
-// Closes the current handle (if any) and empties it; used by the broken-pipe recovery. A
-// connection being opened at that moment is the broken one: its opener closes it. Returns the
-// close result (0 when there was none).
+// Every sensor1 call on a handle goes between these two: lend_handle returns handle while it is
+// still the current one (null once it was closed or replaced, so the call fails as on an empty
+// handle), and the current handle is not closed until return_handle has given it back. Nothing
+// that waits for the callback or for a response may run in between.
+sensor1_handle_s* lend_handle(sensor1_handle_s* handle);
+void return_handle(sensor1_handle_s* lent);
+
+// Around the broken-pipe recovery on the callback thread: meanwhile the recovery alone closes
+// the current handle, so that no other thread waits in sensor1_close for that callback.
+void begin_link_recovery();
+void end_link_recovery();
+
+// Closes the current handle (if any) and empties it; used by the broken-pipe recovery. An open in
+// progress on another thread is waited for first: the connection it makes is the broken one.
+// Returns the close result (0 when there was none).
 int close_sensor1_handle();
 
-// Closes handle and empties the shared one when it is still the current handle; a handle that
-// the broken-pipe recovery already replaced is not closed twice (result 0).
+// Closes handle and empties the shared one when it is still the current handle and no recovery
+// runs; a handle that the recovery replaced or closes itself is left to it (result 0).
 int close_and_forget_handle(sensor1_handle_s* handle);
 
 // Open attempts still allowed.

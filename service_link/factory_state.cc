@@ -45,9 +45,15 @@ int32_t test_status() {
   return status;
 }
 
-void store_accel_result(const int32_t (&words)[8]) { store_words(g_results.accel_result, words); }
-void store_gyro_result(const int32_t (&words)[12]) { store_words(g_results.gyro_result, words); }
-void store_mag_result(const int32_t (&words)[16]) { store_words(g_results.mag_result, words); }
+void store_accel_result(const int32_t (&words)[8]) {
+  store_words(g_results.accel_result, words);
+}
+void store_gyro_result(const int32_t (&words)[12]) {
+  store_words(g_results.gyro_result, words);
+}
+void store_mag_result(const int32_t (&words)[16]) {
+  store_words(g_results.mag_result, words);
+}
 void store_pressure_result(const int32_t (&words)[2]) {
   store_words(g_results.pressure_result, words);
 }

@@ -280,6 +280,7 @@ void handle_indication(const sensor1_msg_header_s& hdr, const uint8_t* body, uin
 }
 
 void handle_broken_pipe() {
+  begin_link_recovery();
   KLOGE("BROKEN_PIPE sensor1_handle %p\n", static_cast<void*>(current_sensor1_handle()));
   if (diag_logging_state() != diag_state::stopped) {
     set_diag_logging_state(diag_state::stopped);
@@ -291,7 +292,7 @@ void handle_broken_pipe() {
   sensor1_handle_s* handle = nullptr;
   for (int i = 0; i < kReopenTries && handle == nullptr; ++i) {
     platform_sleep_seconds(1);
-    handle = get_handle_without_waiting(0);
+    handle = get_handle_for_sensor(0);
   }
   if (handle != nullptr) {
     KLOGE("BROKEN_PIPE success to open sensor1\n");
@@ -300,6 +301,7 @@ void handle_broken_pipe() {
   } else {
     KLOGE("BROKEN_PIPE fail to open sensor1\n");
   }
+  end_link_recovery();
 
   KLOGI("%s read/update light coef efs file in broken pipe\n", "rcv_test_msg");
   pthread_t thread;

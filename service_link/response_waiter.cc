@@ -80,9 +80,13 @@ void signal_response() {
   pthread_mutex_unlock(&register_read_waiter.mutex);
 }
 
-bool command_waiter_arrived_for_testing() { return arrived(&command_waiter); }
+bool command_waiter_arrived_for_testing() {
+  return arrived(&command_waiter);
+}
 
-bool register_read_waiter_arrived_for_testing() { return arrived(&register_read_waiter); }
+bool register_read_waiter_arrived_for_testing() {
+  return arrived(&register_read_waiter);
+}
 
 void reset_response_waiters_for_testing() {
   pthread_mutex_lock(&command_waiter.mutex);

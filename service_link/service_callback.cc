@@ -226,5 +226,9 @@ void rcv_test_msg(intptr_t /*cb_data*/, sensor1_msg_header_s* msg_hdr, int msg_t
   }
 
   // After a broken link the current handle is the new one, or empty.
-  if (msg != nullptr) sensor1_free_msg_buf(current_sensor1_handle(), msg);
+  if (msg != nullptr) {
+    sensor1_handle_s* handle = lend_handle(current_sensor1_handle());
+    sensor1_free_msg_buf(handle, msg);
+    return_handle(handle);
+  }
 }

@@ -7,8 +7,12 @@
 // connection, its own included.
 //
 // Like a phone's client library, sensor1_close does not return while a callback is running on
-// the connection it closes: it waits for that callback to return. A close on the library's own
-// thread (from inside a callback) goes through at once.
+// the connection it closes: it waits for that callback to return (and logs "close waits for a
+// callback" first, so a test knows it got there). A close on the library's own thread (from
+// inside a callback) goes through at once.
+//
+// The callback is registered before the OPEN handshake: records the simulator sends ahead of its
+// OPEN_RESULT reach the callback, on the library thread, while sensor1_open is still waiting.
 //
 // With sensor1_host::use_in_process_peer, connections reach a peer in this process instead, with
 // the same records and the same handle rules, and no library thread: what the peer sends is
@@ -18,10 +22,11 @@
 //
 // A handle is a number, not an address: the connection's slot and the generation of that slot,
 // so a late call on a closed handle gets an error instead of reaching whatever uses the slot
-// next. Connection records are never freed; a closed one whose descriptor is gone is used again
-// by a later open, so a daemon that reconnects for ever keeps a bounded set of them. The file
-// descriptor of a connection is closed only by the library thread (or by the failed open that
-// created it), never while it may sit in the thread's poll set.
+// next, and is counted (sensor1_host_stale_handle_calls). Connection records are never freed; a
+// closed one whose descriptor is gone is used again by a later open, so a daemon that reconnects
+// for ever keeps a bounded set of them. The file descriptor of a connection is closed only by the
+// library thread (or by the failed open that created it), never while it may sit in the thread's
+// poll set.
 #include "sensor1.h"
 
 #include <android/log.h>
@@ -55,7 +60,7 @@ constexpr char kTag[] = "libsensor1";
 constexpr int kHandshakeTimeoutSeconds = 10;
 constexpr int kOpCount = 3;
 
-enum class LinkState { kOpen, kEnded, kClosed };
+enum class LinkState { kOpening, kOpen, kEnded, kClosed };
 
 struct Fault {
   int result = 0;
@@ -98,6 +103,7 @@ struct Connection {
   bool in_callback = false;  // the library thread is inside this connection's callback
   bool fd_to_close = false;  // closed or ended, descriptor still to be closed by the thread
   Fault faults[kOpCount];
+  std::deque<std::vector<uint8_t>> early;  // records that came ahead of OPEN_RESULT
 
   // Library thread only: bytes received and not yet delivered.
   std::vector<uint8_t> rx;
@@ -113,6 +119,7 @@ pthread_once_t g_thread_once = PTHREAD_ONCE_INIT;
 int g_wake[2] = {-1, -1};  // pipe that wakes the library thread when the set changes
 bool g_thread_started = false;
 std::atomic<long> g_outstanding{0};
+std::atomic<long> g_stale_calls{0};
 
 // The in-process way: the peer new connections reach, and the records peers have sent, in
 // arrival order over every connection (an empty record is the end of its connection).
@@ -142,6 +149,15 @@ void release_body(void* body) {
   if (body == nullptr) return;
   free(body);
   g_outstanding.fetch_sub(1);
+}
+
+// A call on a handle that is not empty and not an open connection's: closed, or of a record
+// used again since. On a phone that handle may point at freed memory.
+void count_stale(const char* call, sensor1_handle_s* handle) {
+  if (handle == nullptr) return;
+  g_stale_calls.fetch_add(1);
+  __android_log_print(ANDROID_LOG_ERROR, kTag, "%s on a closed handle %p", call,
+                      static_cast<void*>(handle));
 }
 
 void wake_thread() {
@@ -312,6 +328,29 @@ bool deliver_buffered(Connection* h) {
   return true;
 }
 
+// Delivers the records that came ahead of an OPEN_RESULT, in arrival order per connection.
+void deliver_early_records() {
+  for (;;) {
+    Connection* h = nullptr;
+    std::vector<uint8_t> bytes;
+    pthread_mutex_lock(&g_lock);
+    for (Connection* c : g_connections) {
+      if (!c->early.empty()) {
+        h = c;
+        bytes = std::move(c->early.front());
+        c->early.pop_front();
+        break;
+      }
+    }
+    pthread_mutex_unlock(&g_lock);
+    if (h == nullptr) return;
+    Record rec;
+    if (sensor1_wire::parse(bytes.data(), bytes.size(), &rec) == static_cast<long>(bytes.size())) {
+      deliver(h, rec);
+    }
+  }
+}
+
 void close_retired_descriptors() {
   std::vector<Connection*> retired;
   pthread_mutex_lock(&g_lock);
@@ -365,6 +404,7 @@ void* library_thread(void*) {
   std::vector<Connection*> polled;
   for (;;) {
     close_retired_descriptors();
+    deliver_early_records();
     fds.clear();
     polled.clear();
     fds.push_back({g_wake[0], POLLIN, 0});
@@ -427,6 +467,7 @@ Connection* claim_connection(sensor1_notify_data_cb_t cb, intptr_t cb_data, bool
   h->state = LinkState::kOpen;
   h->fd_to_close = false;
   for (Fault& f : h->faults) f = Fault{};
+  h->early.clear();
   return h;
 }
 
@@ -563,34 +604,47 @@ int sensor1_open(sensor1_handle_s** handle, sensor1_notify_data_cb_t cb, intptr_
   }
   sensor1_host::Peer* peer = g_peer.load();
   if (peer != nullptr) return open_in_process(peer, handle, cb, cb_data);
-  int32_t result = 0;
-  const int fd = sensor1_wire::connect_and_open(host_environment().sensor1_socket,
-                                                kHandshakeTimeoutSeconds, &result);
-  if (fd < 0) {
-    log_line("open -> %d", result);
-    return result;
-  }
   pthread_once(&g_thread_once, start_library_thread);
   if (!g_thread_started) {
-    close(fd);
     log_line("open -> %d", SENSOR1_HOST_EPIPE);
     return SENSOR1_HOST_EPIPE;
   }
   pthread_mutex_lock(&g_lock);
   Connection* h = claim_connection(cb, cb_data, false);
-  // Without its io_lock (taken before g_lock): a late caller checks the handle under g_lock
-  // before it touches the descriptor.
-  h->fd = fd;
-  *handle = handle_of(h);
+  h->state = LinkState::kOpening;  // out of the poll set; its early records are delivered
   pthread_mutex_unlock(&g_lock);
-  log_line("open -> %d", SENSOR1_SUCCESS);
+  int32_t result = 0;
+  const int fd =
+      sensor1_wire::connect_and_open(host_environment().sensor1_socket, kHandshakeTimeoutSeconds,
+                                     &result, [h](std::vector<uint8_t> record) {
+                                       pthread_mutex_lock(&g_lock);
+                                       h->early.push_back(std::move(record));
+                                       pthread_mutex_unlock(&g_lock);
+                                       wake_thread();
+                                     });
+  pthread_mutex_lock(&g_lock);
+  if (fd < 0) {
+    // No handle was given out; the thread makes the record reusable on its next pass.
+    h->state = LinkState::kClosed;
+    h->early.clear();
+    h->fd_to_close = true;
+  } else {
+    // Without its io_lock (taken before g_lock): a late caller checks the handle under g_lock
+    // before it touches the descriptor.
+    h->fd = fd;
+    h->state = LinkState::kOpen;
+    *handle = handle_of(h);
+  }
+  pthread_mutex_unlock(&g_lock);
   wake_thread();
-  return SENSOR1_SUCCESS;
+  log_line("open -> %d", fd < 0 ? result : SENSOR1_SUCCESS);
+  return fd < 0 ? result : SENSOR1_SUCCESS;
 }
 
 int sensor1_close(sensor1_handle_s* handle) {
   Connection* h = find_connection(handle);
   if (h == nullptr) {
+    count_stale("close", handle);
     log_line("close -> %d", SENSOR1_HOST_EINVAL);
     return SENSOR1_HOST_EINVAL;
   }
@@ -598,7 +652,9 @@ int sensor1_close(sensor1_handle_s* handle) {
   pthread_mutex_lock(&g_lock);
   int result = SENSOR1_SUCCESS;
   bool closed_now = false;
-  if (connection_of(handle) != h || h->state == LinkState::kClosed) {
+  const bool stale = connection_of(handle) != h || h->state == LinkState::kClosed ||
+                     h->state == LinkState::kOpening;
+  if (stale) {
     result = SENSOR1_HOST_EINVAL;
   } else {
     take_fault(h, FaultOp::kClose, &result);
@@ -611,10 +667,15 @@ int sensor1_close(sensor1_handle_s* handle) {
   pthread_mutex_unlock(&h->io_lock);
   // No new callback starts on a closed connection; one already running is waited for, unless
   // this is that callback's own thread.
-  while (closed_now && h->in_callback && !t_library_thread) {
-    pthread_cond_wait(&g_callback_returned, &g_lock);
+  const bool waits = closed_now && h->in_callback && !t_library_thread;
+  if (waits) {
+    pthread_mutex_unlock(&g_lock);
+    __android_log_print(ANDROID_LOG_INFO, kTag, "close waits for a callback");
+    pthread_mutex_lock(&g_lock);
   }
+  while (waits && h->in_callback) pthread_cond_wait(&g_callback_returned, &g_lock);
   pthread_mutex_unlock(&g_lock);
+  if (stale) count_stale("close", handle);
   bool tell_peer = false;
   if (closed_now && h->link != nullptr) {
     {
@@ -639,7 +700,9 @@ int sensor1_alloc_msg_buf(sensor1_handle_s* handle, uint16_t size, void** buf) {
   pthread_mutex_lock(&g_lock);
   Connection* h = connection_of(handle);
   int result = SENSOR1_SUCCESS;
-  if (h == nullptr || h->state == LinkState::kClosed) {
+  const bool stale =
+      h == nullptr || h->state == LinkState::kClosed || h->state == LinkState::kOpening;
+  if (stale) {
     result = SENSOR1_HOST_EINVAL;
   } else if (h->state == LinkState::kEnded) {
     result = SENSOR1_HOST_EPIPE;
@@ -647,14 +710,21 @@ int sensor1_alloc_msg_buf(sensor1_handle_s* handle, uint16_t size, void** buf) {
     take_fault(h, FaultOp::kAlloc, &result);
   }
   pthread_mutex_unlock(&g_lock);
+  if (stale) count_stale("alloc", handle);
   if (result != SENSOR1_SUCCESS) return result;
   *buf = alloc_body(size);
   return *buf != nullptr ? SENSOR1_SUCCESS : ENOMEM;
 }
 
-int sensor1_free_msg_buf(sensor1_handle_s*, void* buf) {
-  // Any handle will do, null and closed ones included: after a broken link the daemon frees
-  // bodies with whatever handle is current.
+int sensor1_free_msg_buf(sensor1_handle_s* handle, void* buf) {
+  // An empty handle will do: after a broken link the daemon frees bodies with whatever handle is
+  // current. A closed one is counted; the body is released all the same.
+  pthread_mutex_lock(&g_lock);
+  const Connection* h = connection_of(handle);
+  const bool stale =
+      h == nullptr || h->state == LinkState::kClosed || h->state == LinkState::kOpening;
+  pthread_mutex_unlock(&g_lock);
+  if (stale) count_stale("free", handle);
   release_body(buf);
   return SENSOR1_SUCCESS;
 }
@@ -663,7 +733,10 @@ int sensor1_write(sensor1_handle_s* handle, sensor1_msg_header_s* hdr, void* bod
   if (hdr == nullptr) return SENSOR1_HOST_EINVAL;
   if (body == nullptr && hdr->msg_size != 0) return SENSOR1_HOST_EINVAL;
   Connection* h = find_connection(handle);
-  if (h == nullptr) return SENSOR1_HOST_EINVAL;
+  if (h == nullptr) {
+    count_stale("write", handle);
+    return SENSOR1_HOST_EINVAL;
+  }
   const std::vector<uint8_t> rec = sensor1_wire::encode(sensor1_wire::message(
       sensor1_wire::kWrite, {hdr->service_number, hdr->msg_id, 0, hdr->txn_id},
       static_cast<const uint8_t*>(body), hdr->msg_size));
@@ -672,7 +745,9 @@ int sensor1_write(sensor1_handle_s* handle, sensor1_msg_header_s* hdr, void* bod
   pthread_mutex_lock(&g_lock);
   int result = SENSOR1_SUCCESS;
   bool faulted = false;
-  if (connection_of(handle) != h || h->state == LinkState::kClosed) {
+  const bool stale = connection_of(handle) != h || h->state == LinkState::kClosed ||
+                     h->state == LinkState::kOpening;
+  if (stale) {
     result = SENSOR1_HOST_EINVAL;
   } else if (h->state == LinkState::kEnded) {
     result = SENSOR1_HOST_EPIPE;
@@ -680,6 +755,7 @@ int sensor1_write(sensor1_handle_s* handle, sensor1_msg_header_s* hdr, void* bod
     faulted = take_fault(h, FaultOp::kWrite, &result);
   }
   pthread_mutex_unlock(&g_lock);
+  if (stale) count_stale("write", handle);
   // A write faulted with EWOULDBLOCK still goes out and takes the body, like a success.
   const bool send = result == SENSOR1_SUCCESS || (faulted && result == SENSOR1_EWOULDBLOCK);
   if (send && h->link != nullptr
@@ -701,6 +777,10 @@ void* sensor1_host_alloc_body(size_t size) {
 
 long sensor1_host_outstanding_bodies(void) {
   return g_outstanding.load();
+}
+
+long sensor1_host_stale_handle_calls(void) {
+  return g_stale_calls.load();
 }
 
 }  // extern "C"

@@ -191,7 +191,8 @@ int receive_available(int fd, std::vector<uint8_t>* rx) {
   return got > 0 ? 1 : -1;
 }
 
-int connect_and_open(const char* path, int timeout_seconds, int32_t* result) {
+int connect_and_open(const char* path, int timeout_seconds, int32_t* result,
+                     const std::function<void(std::vector<uint8_t>)>& early) {
   *result = kNotUp;
   sockaddr_un addr;
   memset(&addr, 0, sizeof addr);
@@ -203,23 +204,34 @@ int connect_and_open(const char* path, int timeout_seconds, int32_t* result) {
   // A simulator that accepted but never answers must not hang the caller.
   timeval tv = {timeout_seconds, 0};
   const std::vector<uint8_t> open = encode(plain(kOpen));
-  // The answer is the 9 bytes of an OPEN_RESULT. The buffer holds a whole header record, since
-  // gcc's bounds analysis at -O3 follows parse() into the branches of longer kinds and warns
-  // about reads that its length checks rule out.
-  constexpr size_t kAnswer = kLengthSize + 1 + 4;
-  uint8_t answer[kLengthSize + 1 + 8 + kHdrSize] = {};
-  Record rec;
-  if (connect(fd, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) != 0 ||
-      setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv) != 0 ||
-      !send_all(fd, open.data(), open.size()) || !recv_exact(fd, answer, kAnswer) ||
-      parse(answer, kAnswer, &rec) != static_cast<long>(kAnswer) ||
-      rec.kind != kOpenResult) {
-    close(fd);
-    return -1;
+  bool answered = false;
+  if (connect(fd, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) == 0 &&
+      setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv) == 0 &&
+      send_all(fd, open.data(), open.size())) {
+    // One record at a time, so nothing behind OPEN_RESULT is taken from the socket.
+    for (;;) {
+      std::vector<uint8_t> bytes(kLengthSize);
+      if (!recv_exact(fd, bytes.data(), kLengthSize)) break;
+      const uint32_t length = load_u32(bytes.data(), 0);
+      if (length == 0 || length > kMaxRecord) break;
+      bytes.resize(kLengthSize + length);
+      Record rec;
+      if (!recv_exact(fd, bytes.data() + kLengthSize, length) ||
+          parse(bytes.data(), bytes.size(), &rec) != static_cast<long>(bytes.size())) {
+        break;
+      }
+      if (rec.kind == kOpenResult) {
+        *result = rec.value;
+        answered = true;
+        break;
+      }
+      if (!early) break;
+      early(std::move(bytes));
+    }
   }
-  *result = rec.value;
   tv = {0, 0};
-  if (*result != 0 || setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv) != 0) {
+  if (!answered || *result != 0 || setsockopt(fd, SOL_SOCKET, SO_RCVTIMEO, &tv, sizeof tv) != 0) {
+    if (!answered) *result = kNotUp;
     close(fd);
     return -1;
   }

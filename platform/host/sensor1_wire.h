@@ -12,6 +12,7 @@
 #include <stddef.h>
 #include <stdint.h>
 
+#include <functional>
 #include <vector>
 
 namespace sensor1_wire {
@@ -83,9 +84,12 @@ bool send_all(int fd, const uint8_t* data, size_t size);
 int receive_available(int fd, std::vector<uint8_t>* rx);
 
 // Connects to the simulator at path and does the OPEN handshake, waiting at most timeout_seconds
-// for OPEN_RESULT; exactly that record is read. Returns the connected descriptor, or -1 with
-// *result the simulator's non-zero answer, or 11 when the socket does not exist, refuses the
-// connection or does not answer.
-int connect_and_open(const char* path, int timeout_seconds, int32_t* result);
+// for OPEN_RESULT (the wait starts again with each record before it); exactly the records up to
+// it are read. Records that come ahead of OPEN_RESULT go to early, whole, as they arrive; without
+// early they end the handshake. Returns the connected descriptor, or -1 with *result the
+// simulator's non-zero answer, or 11 when the socket does not exist, refuses the connection or
+// does not answer.
+int connect_and_open(const char* path, int timeout_seconds, int32_t* result,
+                     const std::function<void(std::vector<uint8_t>)>& early = nullptr);
 
 }  // namespace sensor1_wire

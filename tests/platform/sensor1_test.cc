@@ -1,6 +1,7 @@
 // The sensor1 library of the host build against a scripted sensor processor (the simulator, or a
 // raw socket peer where the bytes on the wire matter).
 #include <gtest/gtest.h>
+#include <stdio.h>
 #include <string.h>
 #include <sys/socket.h>
 #include <sys/un.h>
@@ -20,6 +21,7 @@ namespace {
 
 using kestrel_sim::Simulator;
 using std::chrono_literals::operator""s;
+using std::chrono_literals::operator""ms;
 
 class Sensor1Test : public ::testing::Test {
  protected:
@@ -60,6 +62,7 @@ class Sensor1Test : public ::testing::Test {
 
 // Refused opens are driven through the daemon's reopen tries; here, what a connection refuses.
 TEST_F(Sensor1Test, BadWritesAndClosedHandlesAreRefused) {
+  const long stale_before = sensor1_host_stale_handle_calls();
   sensor1_handle_s* h = nullptr;
   ASSERT_EQ(rec.open(&h), 0);
 
@@ -70,7 +73,15 @@ TEST_F(Sensor1Test, BadWritesAndClosedHandlesAreRefused) {
   EXPECT_TRUE(sim->wait_for_disconnect(2s));
   expect_refused(h, SENSOR1_HOST_EINVAL);
   expect_refused(nullptr, SENSOR1_HOST_EINVAL);
-  EXPECT_EQ(lines(), (Lines{"open -> 0", "close -> 0", "close -> 22", "close -> 22"}));
+  // Each call on the closed handle is counted and logged; the empty handle is no closed one.
+  auto stale = [h](const std::string& call) {
+    char handle[32];
+    snprintf(handle, sizeof handle, "%p", static_cast<void*>(h));
+    return call + " on a closed handle " + handle;
+  };
+  EXPECT_EQ(lines(), (Lines{"open -> 0", "close -> 0", stale("alloc"), stale("write"),
+                            stale("close"), "close -> 22", "close -> 22"}));
+  EXPECT_EQ(sensor1_host_stale_handle_calls() - stale_before, 3);
   EXPECT_TRUE(rec.deliveries().empty()) << "a close by the daemon is no broken pipe";
 }
 
@@ -147,6 +158,32 @@ TEST_F(Sensor1Test, CallbackMayBlockCloseItsConnectionAndOpenAnother) {
   EXPECT_EQ(first.summaries(), Lines{"2 [0 13 1 4] 01"});
   EXPECT_EQ(second.summaries(), Lines{"1 [0 64 1 0] 07"});
   EXPECT_EQ(lines(), (Lines{"open -> 0", "open -> 0", "close -> 0", "open -> 0"}));
+}
+
+// A broken pipe sent while the open's answer is held reaches the callback before sensor1_open
+// returns; a close from another thread while that callback runs waits for it, and says so first.
+TEST_F(Sensor1Test, RecordAheadOfTheOpenAnswerReachesTheCallbackDuringTheOpen) {
+  std::promise<void> called;
+  std::atomic<bool> let_go{false};
+  Sensor1Recorder r([&](const Delivery&) {
+    called.set_value();
+    EXPECT_TRUE(eventually([&] { return let_go.load(); }));
+  });
+  sim->hold_opens(5000ms, 1);
+  sensor1_handle_s* h = nullptr;
+  auto opened = std::async(std::launch::async, [&] { return r.open(&h); });
+  ASSERT_TRUE(sim->wait_for_held_open(2s));
+  ASSERT_TRUE(sim->callback_to_held_open(250, true, false, {}, {}));
+  ASSERT_EQ(called.get_future().wait_for(2s), std::future_status::ready);
+  EXPECT_NE(opened.wait_for(0s), std::future_status::ready) << "the open has returned";
+  sim->release_held_opens();
+  ASSERT_EQ(opened.get(), 0);
+  auto closed = std::async(std::launch::async, [&] { return sensor1_close(h); });
+  EXPECT_TRUE(log.wait_for("close waits for a callback", 2000ms, 1, "libsensor1"));
+  let_go = true;
+  EXPECT_EQ(closed.get(), 0);
+  EXPECT_EQ(r.summaries(), Lines{"250 [0 0 0 0] no body"});
+  EXPECT_EQ(lines(), (Lines{"open -> 0", "close waits for a callback", "close -> 0"}));
 }
 
 }  // namespace

@@ -1,15 +1,17 @@
 // The callback on the library's thread against the daemon's others: a broken link torn down and
 // rebuilt (DIAG logging stopped and restarted as the debug level allows, a new coefficient
-// refresh), results handed to a waiting main thread, register dumps kept whole under their lock.
-#include <signal.h>
+// refresh) while other threads open, write and close, results handed to a waiting main thread,
+// register dumps kept whole under their lock. Whatever fails, every thread, held open and stand-in
+// tool a test holds is let go and joined before the test ends.
 #include <stdio.h>
-#include <unistd.h>
 
 #include <algorithm>
+#include <future>
 #include <thread>
 
 #include "callback_fixture.h"
 #include "diag/diag_logging.h"
+#include "requests/request_pattern.h"
 #include "requests/status_requests.h"
 #include "service_link/factory_state.h"
 #include "service_link/response_waiter.h"
@@ -32,6 +34,43 @@ Bytes dump_body(int index, int round) {
   return body;
 }
 
+// A stand-in diag_mdlog that records its call, then waits (20 s at most) until the gate opens;
+// it opens at the latest when the gate goes out of scope.
+class ToolGate {
+ public:
+  explicit ToolGate(const FakeTools& tools) : go_(tools.dir() + "/go") {
+    write_file(tools.dir() + "/diag_mdlog", "#!/bin/sh\necho \"diag_mdlog $*\" >> " + tools.dir() +
+                                                "/calls\ni=0\nwhile [ ! -e " + go_ +
+                                                " ] && [ $i -lt 2000 ]; do sleep 0.01; " +
+                                                "i=$((i+1)); done\n");
+  }
+  ~ToolGate() { open(); }
+  void open() { write_file(go_, ""); }
+
+ private:
+  std::string go_;
+};
+
+// The main thread of a test: runs body on its own thread; at the end of the scope the held opens
+// are let go and the thread is joined.
+class MainThread {
+ public:
+  MainThread(Simulator& sim, std::function<void()> body)
+      : sim_(sim), done_(std::async(std::launch::async, std::move(body))) {}
+  ~MainThread() {
+    sim_.release_held_opens();
+    done_.wait();
+  }
+  // False when the body has not ended within timeout.
+  bool ended(std::chrono::milliseconds timeout) {
+    return done_.wait_for(timeout) == std::future_status::ready;
+  }
+
+ private:
+  Simulator& sim_;
+  std::future<void> done_;
+};
+
 class CallbackThreadsTest : public CallbackTest {
  protected:
   // The daemon's lines once the recovery and the new hh_read_data_thread (with its one frame) have
@@ -46,14 +85,23 @@ class CallbackThreadsTest : public CallbackTest {
   }
 };
 
+// Reopened by the recovery itself, or taken from the main thread's open that was in progress
+// (held longer than the recovery's three tries) when the recovery's first try came.
 TEST_F(CallbackThreadsTest, DroppedLinkIsReopenedAndLoggingRestartedAsTheDebugLevelAllows) {
   sensor1_handle_s* handle = get_handle_for_sensor(0);
-  for (const bool level_stops : {false, true}) {
+  const std::pair<bool, bool> cases[] = {{false, false}, {true, false}, {false, true}};
+  for (const auto& [level_stops, main_opens] : cases) {
     write_file(test_properties_path(),
                level_stops ? "ro.debug_level=0x4f4c" : "ro.debug_level=0x494d");
     set_diag_logging_state(diag_state::logging);
     log->clear();
+    sim->hold_opens(500ms, main_opens ? 1 : 0);
     sim->drop_connection();
+    std::optional<MainThread> main;
+    if (main_opens) {
+      ASSERT_TRUE(log->wait_for("close -> 0", 5000ms, 1, "libsensor1"));
+      main.emplace(*sim, [] { get_handle_for_sensor(0); });
+    }
 
     char broken[64];
     snprintf(broken, sizeof broken, "BROKEN_PIPE sensor1_handle %p\n", static_cast<void*>(handle));
@@ -67,11 +115,11 @@ TEST_F(CallbackThreadsTest, DroppedLinkIsReopenedAndLoggingRestartedAsTheDebugLe
     expected.insert(expected.end(), {kRefresh, kLastLine});
     EXPECT_THAT(recovery_lines(), ElementsAreArray(expected));
     EXPECT_EQ(diag_logging_state(), level_stops ? diag_state::stopped : diag_state::logging);
-    ASSERT_TRUE(tools.wait_for_calls(level_stops ? 3 : 2, 5000));
+    ASSERT_TRUE(tools.wait_for_calls(main_opens ? 5 : level_stops ? 3 : 2, 5000));
     handle = current_sensor1_handle();
   }
-  EXPECT_EQ(sim->opened_connections(), 3);
-  EXPECT_THAT(tools.calls(), ElementsAre(kStop, kStart, kStop));
+  EXPECT_EQ(sim->opened_connections(), 4);
+  EXPECT_THAT(tools.calls(), ElementsAre(kStop, kStart, kStop, kStop, kStart));
 }
 
 TEST_F(CallbackThreadsTest, BrokenLinkWhileACommandWaitsThenResultsReachTheWaitingThread) {
@@ -106,31 +154,70 @@ TEST_F(CallbackThreadsTest, BrokenLinkWhileACommandWaitsThenResultsReachTheWaiti
   }
 }
 
-// A write fails on the main thread while the callback, on the library's thread, is rebuilding the
-// link (held in its DIAG stop until the main thread is inside sensor1_close, which waits for that
-// callback to return): both go on, and the link is rebuilt. A deadlock ends the process.
-TEST_F(CallbackThreadsTest, WriteFailureWhileTheLinkIsRebuiltDoesNotDeadlock) {
-  signal(SIGALRM, [](int) {
-    if (write(2, "deadlock: close and recovery wait for each other\n", 49) > 0) _exit(3);
-  });
-  alarm(10);
+// A write fails on the main thread while the recovery, held in its DIAG stop, has not closed the
+// link yet: the close is left to the recovery, so the main thread does not wait in sensor1_close
+// for that callback.
+TEST_F(CallbackThreadsTest, WriteFailureDuringARecoveryLeavesTheCloseToIt) {
   get_handle_for_sensor(0);
-  write_file(tools.dir() + "/diag_mdlog", "#!/bin/sh\necho \"diag_mdlog $*\" >> " + tools.dir() +
-                                              "/calls\nwhile [ ! -e " + tools.dir() +
-                                              "/go ]; do sleep 0.01; done\n");
+  ToolGate gate(tools);
   set_diag_logging_state(diag_state::logging);
   ASSERT_TRUE(sim->fault(FaultOp::kWrite, 5, 1));
   sim->callback(250, true, false, Header{}, {});
   ASSERT_TRUE(tools.wait_for_calls(1, 5000));
-  std::thread main_thread(get_sensor_state);
-  ASSERT_TRUE(log->wait_for("[get_sensor_state]sensor1_write -error  5\n", 5000ms));
-  std::this_thread::sleep_for(200ms);  // into sensor1_close
-  write_file(tools.dir() + "/go", "");
-  main_thread.join();
+  {
+    MainThread main(*sim, [] { EXPECT_EQ(get_sensor_state(), -1); });
+    EXPECT_TRUE(main.ended(2000ms)) << "the main thread waits for the recovery";
+    gate.open();
+  }
   recovery_lines();
-  alarm(0);
+  EXPECT_EQ(log->count("[get_sensor_state]sensor1_write -error  5\n"), 1u);
   EXPECT_EQ(log->count("BROKEN_PIPE success to open sensor1\n"), 1u);
+  EXPECT_EQ(log->count("close waits for a callback", "libsensor1"), 0u);
   EXPECT_EQ(sim->opened_connections(), 2);
+}
+
+// The link breaks while the main thread opens it for a command (the broken pipe comes while the
+// open's answer is held): the recovery waits for that open and closes the connection it made, on
+// its own thread; its reopen is held in turn, and meanwhile the main thread goes on to command 36.
+TEST_F(CallbackThreadsTest, LinkBrokenWhileTheMainThreadOpensIsClosedByItsRecoveryAlone) {
+  sim->hold_opens(300ms, 1);  // longer than the recovery's three tries
+  {
+    MainThread main(*sim, [this] {
+      command(0, {0});
+      command(36);
+    });
+    ASSERT_TRUE(sim->wait_for_held_open(5000ms));
+    sim->hold_opens(10000ms, 1);
+    ASSERT_TRUE(sim->callback_to_held_open(250, true, false, Header{}, {}));
+    ASSERT_TRUE(log->wait_for("close -> 0", 5000ms, 1, "libsensor1"));
+    ASSERT_TRUE(sim->wait_for_held_open(5000ms));
+    EXPECT_TRUE(log->wait_for("chown : end\n", 5000ms)) << "command 36 waits for the recovery";
+  }
+  recovery_lines();
+  EXPECT_EQ(log->count("BROKEN_PIPE success to open sensor1\n"), 1u);
+  EXPECT_EQ(log->count("close waits for a callback", "libsensor1"), 0u);
+  EXPECT_EQ(sim->opened_connections(), 2);
+  EXPECT_EQ(sim->current_connection(), 2);
+}
+
+// A request whose handle the recovery closed between its steps makes no call on that handle (the
+// fixture counts them): the rest of it goes to the empty handle and fails there (22).
+TEST_F(CallbackThreadsTest, RequestWhoseHandleWasClosedMeanwhileMakesNoCallOnIt) {
+  const std::pair<std::function<void(sensor1_request*)>, Lines> cases[] = {
+      {[](sensor1_request* r) { EXPECT_EQ(write_request(r), 22); }, {}},
+      {[](sensor1_request* r) { EXPECT_FALSE(write_request_or_close(r)); },
+       {"[probe]sensor1_write -error  22\n"}},
+      {abandon_request, {}},
+  };
+  for (const auto& [finish, expected] : cases) {
+    get_handle_for_sensor(0);
+    sensor1_request req;
+    ASSERT_TRUE(begin_request(&req, "probe", 0, 0, 64, 1, 0, alloc_failure_text::kPlain));
+    close_sensor1_handle();
+    log->clear();
+    finish(&req);
+    EXPECT_EQ(lines(), expected);
+  }
 }
 
 TEST_F(CallbackThreadsTest, DumpsFromSeveralThreadsKeepFrameAndLinesTogether) {

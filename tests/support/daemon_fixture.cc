@@ -32,6 +32,7 @@ void DaemonFixture::SetUp() {
   reset_raw_data_flags_for_testing();
   set_diag_logging_state(diag_state::stopped);
   set_netmgr_malloc_for_testing(nullptr);
+  stale_calls_at_setup = sensor1_host_stale_handle_calls();
   log->clear();
 }
 
@@ -39,6 +40,8 @@ void DaemonFixture::TearDown() {
   reset_connection_for_testing();
   sim.reset();
   set_netmgr_malloc_for_testing(nullptr);
+  EXPECT_EQ(sensor1_host_stale_handle_calls(), stale_calls_at_setup)
+      << "a sensor1 call on a closed handle";
   if (check_bodies_released) {
     // Bodies still in flight on the library's thread get a moment to be delivered and freed.
     EXPECT_TRUE(eventually([] { return sensor1_host_outstanding_bodies() == 0; }, 500ms))

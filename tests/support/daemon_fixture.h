@@ -43,6 +43,7 @@ class DaemonFixture : public ::testing::Test {
   std::unique_ptr<kestrel_sim::Simulator> sim;
   // Leave false for tests that deliberately leave bodies behind.
   bool check_bodies_released = true;
+  long stale_calls_at_setup = 0;  // sensor1 calls on closed handles; none may be added
 };
 
 using std::chrono_literals::operator""ms;

@@ -6,6 +6,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <gtest/gtest.h>
+
 #include "test_env.h"
 #include "tools/soak/daemon_driver.h"
 
@@ -46,6 +48,10 @@ DaemonProcess::~DaemonProcess() {
   if (!status_ && pid_ > 0) {
     kill(pid_, SIGKILL);
     wait_exit(std::chrono::milliseconds(5000));
+  }
+  for (const LogRecord& r : records()) {
+    EXPECT_FALSE(r.tag == "libsensor1" && r.message.find("on a closed handle") != std::string::npos)
+        << r.message;
   }
   unlink(log_path_.c_str());
 }

@@ -31,6 +31,7 @@ struct Weighted {
 constexpr Weighted kLinkFaults[] = {
     {ChaosFault::kDrop, 20},       {ChaosFault::kRefusedOpens, 10}, {ChaosFault::kAllocFault, 12},
     {ChaosFault::kWriteFault, 20}, {ChaosFault::kCloseFault, 1},    {ChaosFault::kRetryOpen, 10},
+    {ChaosFault::kHeldOpen, 12},
 };
 constexpr Weighted kRequestFaults[] = {
     {ChaosFault::kDropAtWrite, 30}, {ChaosFault::kDropInWait, 40}, {ChaosFault::kMissing, 40},
@@ -83,6 +84,8 @@ const char* chaos_fault_name(ChaosFault fault) {
       return "answer duplicated";
     case ChaosFault::kRetryOpen:
       return "RETRY_OPEN";
+    case ChaosFault::kHeldOpen:
+      return "open held";
   }
   return "?";
 }
@@ -115,7 +118,11 @@ void ChaosPhone::enable(bool on) {
     std::lock_guard<std::mutex> lock(mu_);
     enabled_ = on;
   }
-  if (!on) sim_.refuse_opens(0, 0);
+  if (!on) {
+    sim_.refuse_opens(0, 0);
+    sim_.hold_opens(Millis(0), 0);
+    sim_.release_held_opens();
+  }
   cv_.notify_all();
 }
 
@@ -225,6 +232,20 @@ void ChaosPhone::run_schedule() {
         done =
             sim_.fault(FaultOp::kClose, settings_.close_status, 1, std::chrono::milliseconds(500));
         break;
+      case ChaosFault::kHeldOpen: {
+        // From half a second to five of the daemon's time: often past the three tries of its
+        // reopen, so another thread's command may be the one that opens. Every other time the
+        // link is reported broken while the open is held.
+        const auto hold =
+            std::chrono::duration_cast<Millis>(std::chrono::duration<double, std::milli>(
+                (500 + extra * 9 / 2) * settings_.time_scale));
+        sim_.hold_opens(hold, 1);
+        sim_.drop_connection();
+        if (extra % 2 == 0 && sim_.wait_for_held_open(Millis(2000) + hold)) {
+          sim_.callback_to_held_open(250, true, false, Header{}, {});
+        }
+        break;
+      }
       default:  // RETRY_OPEN
         sim_.retry_open();
         break;

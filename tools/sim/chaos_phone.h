@@ -1,7 +1,8 @@
 // A sensor processor under chaos: the healthy phone's answers, spoiled by a seeded random schedule
 // of the faults a real link shows in bursts and at the worst moments. The connection is dropped at
 // random moments, as a request arrives and while the daemon waits for its answer; opens are
-// refused in runs; FAULT records make the library's alloc, write and close fail; answers come
+// refused in runs or held (a slow service, the link sometimes reported broken while the open is
+// held); FAULT records make the library's alloc, write and close fail; answers come
 // late (past the daemon's wait), never, or twice; RETRY_OPEN comes out of the blue.
 //
 // The schedule of link faults runs on a thread of its own, the choice for each request on the
@@ -37,8 +38,9 @@ enum class ChaosFault {
   kMissing,       // an answer never sent
   kDuplicated,    // an answer sent twice
   kRetryOpen,     // RETRY_OPEN
+  kHeldOpen,      // the next open answered late, sometimes broken meanwhile; then a drop
 };
-constexpr size_t kChaosFaultKinds = 11;
+constexpr size_t kChaosFaultKinds = 12;
 const char* chaos_fault_name(ChaosFault fault);
 
 struct ChaosSettings {

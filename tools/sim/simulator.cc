@@ -59,10 +59,9 @@ struct Simulator::State final : ConnectionSink {
   int refuse_count = 0;
   Millis hold_for{0};
   int hold_count = 0;
-  bool holding = false;           // an OPEN answer is held now
-  uint64_t hold_releases = 0;     // release_held_opens() calls so far
-  std::vector<Bytes> after_held;  // records behind the next held answer
-  std::vector<ConnPtr> conns;     // every connection not yet reaped
+  ConnPtr held;                // the connection whose OPEN answer is held now
+  uint64_t hold_releases = 0;  // release_held_opens() calls so far
+  std::vector<ConnPtr> conns;  // every connection not yet reaped
   ConnPtr current;
   int opened = 0;
   std::vector<Request> history;
@@ -125,17 +124,16 @@ struct Simulator::State final : ConnectionSink {
     if (hook) hook(*self, c->number, false);
   }
 
-  // Holds the answer of an OPEN when asked to; returns the records that go out behind it.
-  std::vector<Bytes> hold_open() {
+  // Holds the answer of an OPEN when asked to.
+  void hold_open(const ConnPtr& c) {
     std::unique_lock<std::mutex> lock(mu);
-    if (hold_count == 0) return {};
+    if (hold_count == 0) return;
     --hold_count;
-    holding = true;
+    held = c;
     const uint64_t releases = hold_releases;
     cv.notify_all();
     cv.wait_for(lock, hold_for, [&] { return stopping || hold_releases != releases; });
-    holding = false;
-    return std::move(after_held);
+    held.reset();
   }
 
   // The OPEN's result, decided as its answer goes out: a successful open makes the connection
@@ -155,14 +153,12 @@ struct Simulator::State final : ConnectionSink {
   void handle_open(const ConnPtr& c) {
     if (c->answered_open) return;
     c->answered_open = true;
-    std::vector<Bytes> behind = hold_open();
+    hold_open(c);
     int32_t result = 0;
     const bool sent = c->channel->send_made([&] {
       result = open_result(c);
-      std::vector<Bytes> records = {
+      return std::vector<Bytes>{
           sensor1_wire::encode(sensor1_wire::result(sensor1_wire::kOpenResult, result))};
-      if (result == 0) records.insert(records.end(), behind.begin(), behind.end());
-      return records;
     });
     if (!sent || result != 0) {
       end(c);
@@ -292,7 +288,7 @@ void Simulator::release_held_opens() {
 
 bool Simulator::wait_for_held_open(Millis timeout) {
   std::unique_lock<std::mutex> lock(state_->mu);
-  return state_->cv.wait_for(lock, timeout, [&] { return state_->holding; });
+  return state_->cv.wait_for(lock, timeout, [&] { return state_->held != nullptr; });
 }
 
 void Simulator::stop_listening() {
@@ -378,10 +374,14 @@ void Simulator::callback(int32_t msg_type, bool with_header, bool with_body, Hea
                   callback_record(msg_type, with_header, with_body, header, body));
 }
 
-void Simulator::callback_after_held_open(int32_t msg_type, bool with_header, bool with_body,
-                                         Header header, const std::vector<uint8_t>& body) {
-  std::lock_guard<std::mutex> lock(state_->mu);
-  state_->after_held.push_back(callback_record(msg_type, with_header, with_body, header, body));
+bool Simulator::callback_to_held_open(int32_t msg_type, bool with_header, bool with_body,
+                                      Header header, const std::vector<uint8_t>& body) {
+  ConnPtr c;
+  {
+    std::lock_guard<std::mutex> lock(state_->mu);
+    c = state_->held;
+  }
+  return state_->send_to(c, callback_record(msg_type, with_header, with_body, header, body));
 }
 
 bool Simulator::fault(FaultOp op, int32_t result, uint32_t count, Millis timeout) {

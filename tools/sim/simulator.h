@@ -63,11 +63,12 @@ class Simulator {
   void release_held_opens();
   // True once an OPEN answer is being held, within timeout.
   bool wait_for_held_open(Millis timeout);
-  // A callback record (as callback() builds it) that goes out right behind the next successful
-  // held answer, before any other record reaches that connection: the library has it as soon as
-  // its open returns, e.g. a broken pipe (250) of a link that breaks while it is being opened.
-  void callback_after_held_open(int32_t msg_type, bool with_header, bool with_body, Header header,
-                                const std::vector<uint8_t>& body);
+  // A callback record (as callback() builds it) to the connection whose OPEN answer is held now,
+  // ahead of that answer: the library has it while its open is in progress, e.g. a broken pipe
+  // (250) of a link that breaks while it is being opened. In process it comes right behind the
+  // answer. False when no answer is held.
+  bool callback_to_held_open(int32_t msg_type, bool with_header, bool with_body, Header header,
+                             const std::vector<uint8_t>& body);
 
   // Stops accepting (the socket file is removed, so sensor1_open gets 11) or starts again.
   void stop_listening();

@@ -109,7 +109,7 @@ bool parse_options(int argc, char** argv, Options* o) {
 class Chaos {
  public:
   explicit Chaos(const Options& o)
-      : o_(o), dir_("kestrel-chaos"), log_(dir_.file("kestreld.log")) {}
+      : o_(o), dir_("kestrel-chaos"), log_(dir_.file("kestreld.log"), {"on a closed handle"}) {}
   int run();
 
  private:
@@ -431,6 +431,7 @@ void Chaos::print_figures() {
          last_.rss_kib, last_.rss_anon_kib, last_.descriptors, last_.threads);
   if (overruns_ > 0) printf("chaos: the kernel port's queue overflowed %ld times\n", overruns_);
   check(verdicts_.ok(), "the daemon ended only with the close's result, and settled each time");
+  check(log_.seen("on a closed handle") == 0, "no sensor1 call on a closed handle");
   check(faults > 0 && commands_ > 0 && slowest_ms_ <= static_cast<double>(bound_.count()),
         "every command done within the scaled wait and the margin");
 }

@@ -2,7 +2,8 @@
 // includes this file.
 //
 // Results of the host library, beside 0 (success) and 11 (EWOULDBLOCK, the service is not up):
-//   22 (EINVAL)  a null or closed handle, a null header, a null output pointer, or a null body
+//   22 (EINVAL)  a null or closed handle (a closed one is counted, see below), a null header, a
+//   null output pointer, or a null body
 //                with a non-zero message size;
 //   32 (EPIPE)   the service ended the connection (after the broken-pipe callback), or a record
 //                could not be sent;
@@ -25,6 +26,12 @@ void* sensor1_host_alloc_body(size_t size);
 // Bodies allocated by the library (sensor1_alloc_msg_buf, received messages, the function above)
 // and not yet released, over the whole process.
 long sensor1_host_outstanding_bodies(void);
+
+// Calls made with a handle that is not empty and not an open connection's (closed, or of a
+// connection gone since), over the whole process: alloc, write, close and free. Each is also
+// logged at error as "<call> on a closed handle <handle>". On a phone such a handle may point at
+// freed memory, so the daemon must make none.
+long sensor1_host_stale_handle_calls(void);
 
 #ifdef __cplusplus
 }
