@@ -1,23 +1,27 @@
 // SPDX-License-Identifier: GPL-2.0
 /*
- * The factory driver's netlink side: the kernel end of netlink protocol 23, which sends test
- * command frames to the factory test daemon and takes every frame the daemon sends back.
+ * The factory driver's netlink side: the kernel end of netlink protocol 23,
+ * which sends test command frames to the factory test daemon and takes every
+ * frame the daemon sends back.
  *
  * User space drives it through a misc character device, /dev/kestrel_factory:
- *   write()  one command frame (nlmsghdr and payload; nlmsg_len is the write's length, or that
- *            length less the alignment bytes after the payload), sent to the daemon's port id
- *            from port id 0;
- *   read()   one whole datagram the daemon sent, in arrival order, for every file opened for
- *            reading (each such file has its own bounded queue);
+ *   write()  one command frame (nlmsghdr and payload; nlmsg_len is the
+ *            write's length, or that length less the alignment bytes after
+ *            the payload), sent to the daemon's port id from port id 0;
+ *   read()   one whole datagram the daemon sent, in arrival order, for every
+ *            file opened for reading (each such file has its own bounded
+ *            queue);
  *   poll()   readable while that queue holds a datagram, always writable.
- * Counters sit beside the device in sysfs (sent, received, malformed, rejected writes, and
- * dropped: every datagram of the daemon that a reading file did not get, because none was open,
- * its queue was full, or it was closed before reading it); debugfs has an "inject" file whose every write goes
- * to the daemon unchecked, for tests of the daemon's frame walk.
+ * Counters sit beside the device in sysfs (sent, received, malformed,
+ * rejected writes, and dropped: every datagram of the daemon that a reading
+ * file did not get, because none was open, its queue was full, or it was
+ * closed before reading it); debugfs has an "inject" file whose every write
+ * goes to the daemon unchecked, for tests of the daemon's frame walk.
  *
- * The kernel filters netlink protocols it does not know from netlink monitors (nlmon), so the
- * module hands a copy of every frame it sends and receives to each netlink monitor device that
- * is up, the way the kernel's own taps do, and a capture on nlmon0 shows the whole session.
+ * The kernel filters netlink protocols it does not know from netlink
+ * monitors (nlmon), so the module hands a copy of every frame it sends and
+ * receives to each netlink monitor device that is up, the way the kernel's
+ * own taps do, and a capture on nlmon0 shows the whole session.
  */
 #include <linux/atomic.h>
 #include <linux/debugfs.h>
@@ -31,6 +35,8 @@
 #include <linux/netdevice.h>
 #include <linux/netlink.h>
 #include <linux/poll.h>
+#include <linux/rcupdate.h>
+#include <linux/refcount.h>
 #include <linux/skbuff.h>
 #include <linux/slab.h>
 #include <linux/spinlock.h>
@@ -45,11 +51,13 @@
 
 static unsigned int daemon_port = 20000;
 module_param(daemon_port, uint, 0644);
-MODULE_PARM_DESC(daemon_port, "netlink port id of the factory test daemon (default 20000)");
+MODULE_PARM_DESC(daemon_port,
+		 "netlink port id of the factory test daemon (default 20000)");
 
 static bool mirror = true;
 module_param(mirror, bool, 0644);
-MODULE_PARM_DESC(mirror, "copy every frame to the netlink monitor devices that are up");
+MODULE_PARM_DESC(mirror,
+		 "copy every frame to the netlink monitor devices that are up");
 
 /* Payload size of every frame type the daemon sends. */
 static const struct {
@@ -71,7 +79,6 @@ static struct sock *kf_sock;
 static struct dentry *kf_debugfs;
 static LIST_HEAD(kf_readers);
 static DEFINE_SPINLOCK(kf_readers_lock);
-static atomic_t kf_in_input = ATOMIC_INIT(0);
 
 static atomic_long_t kf_sent = ATOMIC_LONG_INIT(0);
 static atomic_long_t kf_received = ATOMIC_LONG_INIT(0);
@@ -79,7 +86,10 @@ static atomic_long_t kf_malformed = ATOMIC_LONG_INIT(0);
 static atomic_long_t kf_dropped = ATOMIC_LONG_INIT(0);
 static atomic_long_t kf_rejected = ATOMIC_LONG_INIT(0);
 
-/* One datagram of the daemon: a single frame whose length and payload size its type fixes. */
+/*
+ * One datagram of the daemon: a single frame whose length and payload size
+ * its type fixes.
+ */
 static bool kf_frame_ok(const u8 *data, unsigned int len)
 {
 	struct nlmsghdr hdr;
@@ -92,15 +102,18 @@ static bool kf_frame_ok(const u8 *data, unsigned int len)
 		return false;
 	for (i = 0; i < ARRAY_SIZE(kf_frame_sizes); i++)
 		if (kf_frame_sizes[i].type == hdr.nlmsg_type)
-			return hdr.nlmsg_len == NLMSG_SPACE(kf_frame_sizes[i].payload);
+			return hdr.nlmsg_len ==
+			       NLMSG_SPACE(kf_frame_sizes[i].payload);
 	return false;
 }
 
 /*
- * A copy of one datagram for every netlink monitor that is up, as the kernel's taps make it:
- * packet type PACKET_KERNEL for a datagram to the kernel, PACKET_USER for one from it.
+ * A copy of one datagram for every netlink monitor that is up, as the
+ * kernel's taps make it: packet type PACKET_KERNEL for a datagram to the
+ * kernel, PACKET_USER for one from it.
  */
-static struct sk_buff *kf_mirror_copies(const void *data, unsigned int len, bool to_kernel)
+static struct sk_buff *kf_mirror_copies(const void *data, unsigned int len,
+					bool to_kernel)
 {
 	struct sk_buff *list = NULL;
 	struct net_device *dev;
@@ -152,7 +165,6 @@ static void kf_input(struct sk_buff *skb)
 	struct kf_reader *r;
 	bool queued = false;
 
-	atomic_inc(&kf_in_input);
 	atomic_long_inc(&kf_received);
 	if (!kf_frame_ok(skb->data, skb->len))
 		atomic_long_inc(&kf_malformed);
@@ -163,7 +175,12 @@ static void kf_input(struct sk_buff *skb)
 		struct sk_buff *copy = NULL;
 
 		queued = true;
-		if (skb_queue_len(&r->queue) < KF_QUEUE_LEN)
+		/*
+		 * Only this function adds to the queue, under kf_readers_lock;
+		 * kf_read takes from it under the queue's own lock, so read
+		 * the length locklessly (a stale value is only ever larger).
+		 */
+		if (skb_queue_len_lockless(&r->queue) < KF_QUEUE_LEN)
 			copy = alloc_skb(skb->len, GFP_ATOMIC);
 		if (!copy) {
 			atomic_long_inc(&kf_dropped);
@@ -176,10 +193,13 @@ static void kf_input(struct sk_buff *skb)
 	spin_unlock_bh(&kf_readers_lock);
 	if (!queued)
 		atomic_long_inc(&kf_dropped);
-	atomic_dec(&kf_in_input);
 }
 
-/* One datagram of len bytes from user space to the daemon, from port id 0. */
+/*
+ * One datagram of len bytes from user space to the daemon, from port id 0.
+ * With check, the caller has made sure that len >= NLMSG_HDRLEN, which is
+ * sizeof(struct nlmsghdr): the header is whole in the skb.
+ */
 static ssize_t kf_send(const char __user *buf, size_t len, bool check)
 {
 	struct sk_buff *skb, *copies;
@@ -196,7 +216,8 @@ static ssize_t kf_send(const char __user *buf, size_t len, bool check)
 	if (check) {
 		memcpy(&hdr, skb->data, sizeof(hdr));
 		if (hdr.nlmsg_len < NLMSG_HDRLEN ||
-		    (hdr.nlmsg_len != len && NLMSG_ALIGN(hdr.nlmsg_len) != len)) {
+		    (hdr.nlmsg_len != len &&
+		     NLMSG_ALIGN(hdr.nlmsg_len) != len)) {
 			atomic_long_inc(&kf_rejected);
 			kfree_skb(skb);
 			return -EINVAL;
@@ -205,7 +226,8 @@ static ssize_t kf_send(const char __user *buf, size_t len, bool check)
 	copies = kf_mirror_copies(skb->data, len, false);
 	NETLINK_CB(skb).portid = 0;
 	NETLINK_CB(skb).dst_group = 0;
-	err = netlink_unicast(kf_sock, skb, READ_ONCE(daemon_port), MSG_DONTWAIT);
+	err = netlink_unicast(kf_sock, skb, READ_ONCE(daemon_port),
+			      MSG_DONTWAIT);
 	kf_mirror_send(copies, err >= 0);
 	if (err < 0)
 		return err;
@@ -213,7 +235,8 @@ static ssize_t kf_send(const char __user *buf, size_t len, bool check)
 	return len;
 }
 
-static ssize_t kf_write(struct file *file, const char __user *buf, size_t len, loff_t *ppos)
+static ssize_t kf_write(struct file *file, const char __user *buf,
+			size_t len, loff_t *ppos)
 {
 	if (len < NLMSG_HDRLEN || len > KF_MAX_FRAME) {
 		atomic_long_inc(&kf_rejected);
@@ -222,7 +245,13 @@ static ssize_t kf_write(struct file *file, const char __user *buf, size_t len, l
 	return kf_send(buf, len, true);
 }
 
-static ssize_t kf_read(struct file *file, char __user *buf, size_t len, loff_t *ppos)
+static bool kf_readable(struct kf_reader *r)
+{
+	return !skb_queue_empty_lockless(&r->queue);
+}
+
+static ssize_t kf_read(struct file *file, char __user *buf, size_t len,
+		       loff_t *ppos)
 {
 	struct kf_reader *r = file->private_data;
 	struct sk_buff *skb;
@@ -245,7 +274,7 @@ static ssize_t kf_read(struct file *file, char __user *buf, size_t len, loff_t *
 			break;
 		if (file->f_flags & O_NONBLOCK)
 			return -EAGAIN;
-		err = wait_event_interruptible(r->wait, !skb_queue_empty_lockless(&r->queue));
+		err = wait_event_interruptible(r->wait, kf_readable(r));
 		if (err)
 			return err;
 	}
@@ -261,7 +290,7 @@ static __poll_t kf_poll(struct file *file, poll_table *wait)
 
 	if (r) {
 		poll_wait(file, &r->wait, wait);
-		if (!skb_queue_empty_lockless(&r->queue))
+		if (kf_readable(r))
 			mask |= EPOLLIN | EPOLLRDNORM;
 	}
 	return mask;
@@ -312,8 +341,8 @@ static const struct file_operations kf_fops = {
 	.llseek = no_llseek,
 };
 
-static ssize_t kf_inject_write(struct file *file, const char __user *buf, size_t len,
-			       loff_t *ppos)
+static ssize_t kf_inject_write(struct file *file, const char __user *buf,
+			       size_t len, loff_t *ppos)
 {
 	if (len < 1 || len > KF_MAX_FRAME)
 		return -EMSGSIZE;
@@ -327,8 +356,9 @@ static const struct file_operations kf_inject_fops = {
 	.llseek = no_llseek,
 };
 
-#define KF_COUNTER(name)							\
-static ssize_t name##_show(struct device *dev, struct device_attribute *attr, char *buf) \
+#define KF_COUNTER(name)						\
+static ssize_t name##_show(struct device *dev,				\
+			   struct device_attribute *attr, char *buf)	\
 {									\
 	return sysfs_emit(buf, "%ld\n", atomic_long_read(&kf_##name));	\
 }									\
@@ -366,8 +396,10 @@ static int __init kf_init(void)
 	int err;
 
 	/*
-	 * No module owns the protocol: the daemon's socket must not pin the module, so that it
-	 * can be unloaded and loaded again while the daemon keeps its socket bound.
+	 * No module owns the protocol: the daemon's socket must not pin the
+	 * module, so that it can be unloaded and loaded again while the daemon
+	 * keeps its socket bound. kf_exit makes up for the reference this
+	 * gives away.
 	 */
 	kf_sock = __netlink_kernel_create(&init_net, KF_PROTOCOL, NULL, &cfg);
 	if (!kf_sock)
@@ -386,14 +418,30 @@ static void __exit kf_exit(void)
 {
 	debugfs_remove_recursive(kf_debugfs);
 	misc_deregister(&kf_misc);
+	/*
+	 * Without a module reference behind the protocol, a daemon thread can
+	 * still be on its way into kf_input after the release: netlink_unicast
+	 * looks the socket up (taking a socket reference inside an RCU read
+	 * section), leaves that section and only then calls the socket's
+	 * netlink_rcv, dropping the reference after it returns. A counter in
+	 * kf_input or synchronize_rcu() alone cannot see a thread between the
+	 * lookup and the call. The socket reference can: hold one of our own
+	 * across the release and wait until it is the only one left. The
+	 * release unhashes the socket, so no new lookup finds it, and drops
+	 * its own reference only after an RCU grace period (rcu_barrier()
+	 * waits for that drop), by which time every lookup that did find it
+	 * holds its reference; so once ours is the last, no thread is in, or
+	 * about to enter, this module's text.
+	 */
+	sock_hold(kf_sock);
 	netlink_kernel_release(kf_sock);
-	/* A daemon thread may still be inside kf_input through a lookup made before the release. */
-	synchronize_rcu();
-	while (atomic_read(&kf_in_input))
-		msleep(1);
+	rcu_barrier();
+	while (refcount_read(&kf_sock->sk_refcnt) > 1)
+		usleep_range(1000, 2000);
+	sock_put(kf_sock);
 }
 
 module_init(kf_init);
 module_exit(kf_exit);
 MODULE_LICENSE("GPL");
-MODULE_DESCRIPTION("Factory test driver: the kernel end of netlink protocol 23");
+MODULE_DESCRIPTION("Factory test driver: kernel end of netlink protocol 23");
