@@ -1,3 +1,4 @@
+# SPDX-License-Identifier: Apache-2.0
 # The two commands of a fresh Debian machine: `make demo` and `make test`. Both install what is
 # missing through apt-get when run as root, and say what to install otherwise.
 BUILD ?= build

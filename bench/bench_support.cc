@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 #include "bench/bench_support.h"
 
 #include <errno.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // What the benchmark programs share beside the daemon driver (the daemon, kestrel-sim and the bare
 // relays as child processes, and their /proc readings): a private network namespace, the kernel
 // side of the netlink channel, and a reporter that turns the runs into figures set against their

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The idle footprint: resident memory and threads of a kestreld that has started up, connected
 // to kestrel-sim and finished its start-up threads (the DIAG start thread and the refresh
 // thread), and the CPU time it takes over 60 idle seconds: zero, since nothing in it polls.

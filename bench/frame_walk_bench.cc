@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The frame walk: a full 1024-byte datagram of 64 frames whose command numbers are above 36, so
 // each costs the walk and its one "process_message: <command>" line and nothing else. Measured
 // per frame with the log going to a no-op logger and to liblog's real stderr logger (stderr on

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The command round trip: an accelerometer self test (command 8, sensor_type 0) sent from the
 // kernel side through a running kestreld and an in-process kestrel_sim::Simulator playing the
 // healthy phone, until the type-9 reply is back; set against a bare ping-pong over the same hops

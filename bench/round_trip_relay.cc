@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The relays of the command round trip (round_trip_bench starts them): relay i takes an
 // accelerometer self test from its kernel side, writes the request record to its simulator, waits
 // for the indication and sends the type-9 reply back. With no duties that is all: no threads, no

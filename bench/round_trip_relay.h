@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The relays of the command round trip: the bare ping-pong that the daemon's round trip is set
 // against, and the same with the duties of the daemon's design added, one at a time and all
 // together. Each relay is a process of its own (round_trip_relay) with its own netlink port ids.

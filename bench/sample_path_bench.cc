@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The sample path: one sample indication through the service callback, its conversion and its
 // kernel frame sent onto a real netlink socket, set against a bare sendmsg of the same 32-byte
 // frame on the same socket; and the conversion alone.

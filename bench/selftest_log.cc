@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The log records of a self test, from a daemon of its own whose log goes to a file.
 #include "bench/selftest_log.h"
 

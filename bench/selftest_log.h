@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The log records kestreld writes for an accelerometer self test, taken from a daemon of its own
 // whose log goes to a file: how many a self test writes, and the records of one, which the relays
 // of the round trip replay in place of the daemon's own lines.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The sustained stream: the highest rate of sample indications a running kestreld forwards to
 // the kernel side as type-2 frames with no loss, set against a bare relay that copies records
 // from its simulator's socket to a netlink socket and does nothing else.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Command 6: asks the sensor manager to run one sensor's calibration test and store the result,
 // waits for its completion and tells the kernel driver whether it came (frame type 7). The
 // test's outcome itself reaches factory_results through the service callback.

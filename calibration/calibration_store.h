@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Command 6: run and store the calibration of one sensor.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The light sensor's data from the kernel driver, passed on to its driver on the sensor processor
 // as daf_requests: the hidden-hole coefficients (command 35) and the opaque bulk-data blocks
 // (kBigdataKinds). Neither waits: where the driver answers, the service

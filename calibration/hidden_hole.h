@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Command 35 (the light sensor's hidden-hole coefficients) and the bulk-data commands.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Command 4: the factory calibration of one sensor, read from the sensors registry and reported
 // to the kernel driver as one calibration_report (frame type 5). The registry is opened and
 // closed anew for every command; nothing outlives it.

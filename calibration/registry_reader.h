@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Command 4: factory calibration items of one sensor from the sensors registry.
 #pragma once
 

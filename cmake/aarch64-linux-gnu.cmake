@@ -1,3 +1,4 @@
+# SPDX-License-Identifier: Apache-2.0
 # Cross build for 64-bit ARM, the phone's ABI, with Debian's g++-aarch64-linux-gnu against the
 # arm64 packages of Debian's multiarch (android-liblog-dev:arm64, libgtest-dev:arm64,
 # libgmock-dev:arm64). The programs run under qemu-user (see below):

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The daemon's entry point and main thread: the single-instance guard, the start-up order, the
 // two start-up threads and the endless receive loop.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // On-device DIAG logging of the sensor processor: whether it may run, starting and stopping it,
 // and its state (bit 0 logging enabled, bit 1 a dump thread started).
 //

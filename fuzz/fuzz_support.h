@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // What every fuzz target shares: a private directory of KESTREL_* files set up before the
 // daemon's code first reads its environment, the phone (kestrel-sim's, reached in process on the
 // caller's thread, so a write's answers are in before it returns), the interposed shell and log,

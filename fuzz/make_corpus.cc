@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Writes the seed corpora of the fuzz targets: valid messages, one file each, that start every
 // target on the paths a working phone takes.
 //

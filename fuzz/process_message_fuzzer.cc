@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // process_message on an arbitrary datagram of at most 1024 bytes, copied into a 1024-byte
 // receive buffer as the receive loop does. Every handler runs against the in-process sensor1
 // library reaching kestrel-sim's phone in process, which answers at once, the host registry (a

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The properties file of the host build, as __system_property_get reads it for the two names the
 // daemon asks for, and the daemon's USB-configuration check over it. The input is the whole file.
 // (The file is read anew at every call; each read is a handful of system calls, so the target

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // rcv_test_msg, the service callback, on an arbitrary message: any message type, a header or
 // none, a body or none, of any size (shorter than every layout included). The body comes from the
 // sensor1 library's allocator with exactly its size, and msg_size is that size.

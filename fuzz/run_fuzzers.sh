@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # Builds the libFuzzer targets with clang in a build directory of their own and runs each for a
 # bounded time, one process at a time. Fails when any target finds a crash, a leak, a sanitizer
 # report or a hang, or cannot run at all.

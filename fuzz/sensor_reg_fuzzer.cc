@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The sensors-registry file of the host build: the parser alone (sensor_reg_host_parse on an
 // exact-size copy, with no terminator), the library over the file (open, a read of every item
 // the daemon asks for, close), and the daemon's command 4 over the same file for each kind of

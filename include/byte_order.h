@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Little-endian field access for the fixed-layout records the daemon exchanges with the kernel
 // driver and the sensor service. Fields are always copied with memcpy, never read through a
 // cast of a byte pointer, so the alignment of a field inside a received buffer never matters.

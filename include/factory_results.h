@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The latest results of factory tests, handed from the service callback to the command
 // handlers, and the magnetometer sensitivities the sample conversion divides by.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The kernel frame: one netlink message, a 16-byte nlmsghdr followed by the payload, in host
 // byte order (little-endian). Inbound, nlmsg_type is the command number and the payload starts
 // with sensor_type; outbound, nlmsg_type is the frame type and nlmsg_pid is the daemon's port id.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The sensors as the kernel factory driver knows them. Commands name a sensor by its sensor_type,
 // the kernel's index (0 to 15 on the phone, any signed 32-bit value on the wire), which the
 // daemon maps to a sensor-manager id; replies and samples name it by the kernel's sensor code,

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Every line of the daemon goes to the Android log under one tag.
 #pragma once
 

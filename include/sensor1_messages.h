@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The sensor1 messages the daemon writes and reads: services, message ids, transaction ids,
 // request body layouts and the offsets it reads in responses and indications.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Shell commands run through system(). Their exit status is never examined.
 #pragma once
 

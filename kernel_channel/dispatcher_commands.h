@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The commands the dispatcher carries out itself.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The kernel channel: one netlink socket bound to the daemon's port id, and the one function
 // through which every outbound frame leaves the daemon.
 #pragma once

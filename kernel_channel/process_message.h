@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The command dispatcher: walks the kernel frames of one datagram and runs one command a frame.
 #pragma once
 

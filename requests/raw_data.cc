@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Start and stop of raw-data streams. The sensor manager streams a periodic report, added and
 // deleted by report id; the light sensor (sensor_types 4 and 5) is polled by its driver, started
 // and stopped through the driver access service.

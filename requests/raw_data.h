@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Start and stop of raw-data streams (commands 1 and 3).
 #pragma once
 

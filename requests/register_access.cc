@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Access to sensor internals and device controls: the magnetometer's fuse ROM and registers and
 // the accelerometer's low-pass filter through the sensor manager's test request, the motor state
 // and the register dumps through the driver access service.

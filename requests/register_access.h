@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Magnetometer fuse ROM and registers, accelerometer low-pass filter, motor state, register
 // dumps.
 #pragma once

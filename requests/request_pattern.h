@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // How every sensor1 request is allocated, written and abandoned on failure.
 #pragma once
 

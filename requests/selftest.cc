@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Factory self tests run inside the sensor manager, and the two gyroscope replies built from
 // their result words.
 #include "selftest.h"

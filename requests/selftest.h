@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Factory self tests and the gyroscope replies.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 #include "sensor_tables.h"
 
 #include <string.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The kernel's sensor_type against the sensor manager's ids, the reply codes, and the sensor
 // UIDs of the drivers reached through the driver access service.
 #pragma once

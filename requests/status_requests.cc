@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The three small requests of the sensor manager: its sensor-state table, the status of one
 // sensor, and the magnetometer calibration reset.
 #include "status_requests.h"

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The three small status requests of the sensor manager.
 #pragma once
 

@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # The phone's side, as far as a workstation can check it (docs/device.md):
 #   1. the daemon, its host stand-ins and the tests cross-built for arm64 (build-arm64), and every
 #      test that runs in-process run under qemu-user, each in its own network namespace. Left out:

@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # make bench: builds the benchmarks in Release, runs them all (each in a private network namespace
 # of its own) and writes docs/performance.md from what they measured.
 #   BENCH_BUILD   build directory (default build-bench)

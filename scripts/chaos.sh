@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # make chaos: kestreld under a seeded random schedule of link faults and commands
 # (scripts/chaos.sh [build-dir]). Runs kestrel-chaos in a network namespace of its own, first on
 # the daemon of the build, then on the daemon built with ThreadSanitizer in build-tsan. Prints the

@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # make demo: a factory session against the simulated sensor processor. Starts kestrel-sim and
 # kestreld in a private network namespace, drives the daemon with kestrelctl as the kernel's
 # factory driver would, and shows what came back.

@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # The demo's session, run inside its own network namespace by scripts/demo.sh. What it leaves:
 # the session's capture (every frame both ways), the accelerometer stream as a plot and as CSV,
 # and everything kestrelctl printed, in KESTREL_DEMO_OUT (default: demo/ in the build directory).

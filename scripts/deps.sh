@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # Makes sure the Debian packages a target needs are installed: installs them with apt-get when
 # run as root, and otherwise says exactly what to install.
 #   scripts/deps.sh base|fuzz|soak|arm64|vm

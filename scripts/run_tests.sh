@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # Runs every test through CTest: the whole suite on the normal build and, with SANITIZE=1 (as in
 # CI), once more under AddressSanitizer with UndefinedBehaviorSanitizer and the concurrency tests
 # under ThreadSanitizer. CTest's summary line closes the output.

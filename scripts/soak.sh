@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # make soak: kestreld's long run (scripts/soak.sh [build-dir]). Runs kestrel-soak in a network
 # namespace of its own, twice: the full soak (one million sample indications and one hundred
 # thousand commands of every kind, memory, descriptors and threads compared between the end of

@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # `make vm-test`: kestreld against a real Linux kernel. Builds the factory driver module against
 # the headers of the kernel it boots (with W=1 and sparse, no warning allowed), packs an initramfs
 # with the daemon, kestrel-sim, kestrelctl, the module and what they load, boots it under qemu

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The one sensor1 connection of the process, opened on demand within a budget of consecutive
 // failed attempts that lasts for the whole life of the process.
 #pragma once

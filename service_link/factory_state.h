@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The shared store of the latest factory test results and the magnetometer sensitivities.
 // Written by the service callback, read by the command handlers after wait_for_response.
 #pragma once

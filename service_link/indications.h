@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The indication and link-event branches of rcv_test_msg: test results into the factory store,
 // samples and light-sensor polling data out to the kernel, and the recovery of a broken link.
 // Everything here runs on the sensor1 library's thread.

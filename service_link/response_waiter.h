@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The rendezvous by which a request on the main thread waits, at most 8 s, until the service
 // callback on the library's thread reports that the awaited result has arrived.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Conversion of a sensor-manager sample indication into the kernel's sample_frame.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // rcv_test_msg: the one callback the sensor1 library calls, on its own thread, for every
 // response, indication and link event of the daemon's connection.
 #pragma once

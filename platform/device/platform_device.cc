@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Phone side of the platform interface: protocol 23 to the kernel factory driver at port id 0,
 // absolute paths as they are, and the delays as they are.
 #include <stdio.h>

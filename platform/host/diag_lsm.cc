@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // libdiag of the host build. Nothing is configured for real: Diag_LSM_Init succeeds unless
 // KESTREL_DIAG_INIT is "fail", and the buffering-mode call returns KESTREL_DIAG_TX_MODE_RESULT.
 // Every call logs one info line under the tag "libdiag", so a test sees the order of these calls

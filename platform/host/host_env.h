@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The KESTREL_* environment of the host build, read once on first use.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Host side of the platform interface: netlink protocol KESTREL_NETLINK_PROTOCOL (NETLINK_USERSOCK
 // unless set), the kernel played by whoever binds KESTREL_KERNEL_PORT, paths under KESTREL_SYSROOT
 // and delays scaled by KESTREL_TIME_SCALE.

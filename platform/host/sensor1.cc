@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The sensor1 client library of the host build. Each connection is a Unix stream socket to
 // kestrel-sim at KESTREL_SENSOR1_SOCKET carrying the records of sensor1_wire.h.
 //

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The records the host build's sensor1 library and kestrel-sim exchange on a Unix stream socket,
 // in both directions:
 //

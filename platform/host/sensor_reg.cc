@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Sensors registry stand-in: the items of the KESTREL_SENSOR_REG text file, read anew at every
 // sensor_reg_open. One line each:
 //

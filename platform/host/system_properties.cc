@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // System properties from the KESTREL_PROPERTIES file: "name=value" a line, '#' comments. The
 // file is read on every call, so a test may change it while the daemon runs.
 #include <stdio.h>

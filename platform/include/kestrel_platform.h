@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // What differs between the phone and a workstation, behind one small interface, so that the
 // daemon's sources are the same in both builds. The device implementation is a few constants
 // and plain sleeps; the host one reads the KESTREL_* environment once.

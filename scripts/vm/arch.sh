@@ -1,3 +1,4 @@
+# SPDX-License-Identifier: Apache-2.0
 # The architecture-specific part of `make vm-test`, sourced by scripts/vm_test.sh: which kernel
 # boots, which emulator and machine, the console, the module's cross-build variables, the build
 # directory of the target's programs and how their shared libraries are found. ARCH=x86_64 is the

@@ -1,3 +1,4 @@
+# SPDX-License-Identifier: Apache-2.0
 # shellcheck shell=bash disable=SC2034  # the settings are read by scripts/vm_test.sh
 # ARCH=arm64 of `make vm-test`, sourced by scripts/vm/arch.sh: Debian's arm64 kernel booted by
 # qemu-system-aarch64 (-M virt, cortex-a57, software emulation), the module cross-built against

@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # Checks Android.bp the way a device tree will read it:
 #   - bpfmt parses it, and it is formatted as bpfmt formats it;
 #   - every file it names exists in the repository;

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Command 6 against the simulated sensor manager: the single-sensor test request byte for byte,
 // the completion that the sensor manager sends back (or does not), and the type-7 reply.
 #include "calibration/calibration_store.h"

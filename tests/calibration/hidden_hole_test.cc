@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Commands 35 and 22..32 against the simulated sensor processor: each request as it arrives,
 // header and all 288 body bytes, the log lines around it, and the refused data lengths.
 #include "request_fixture.h"

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Command 4 against the registry stand-in: the report frame byte for byte, and the daemon's and
 // the registry library's log lines in the order they were made. The moment the report leaves
 // is marked in the log by the frame allocator seam, so the close can be seen to come after it.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The single-instance guard: its socket may be descriptor 0 (a daemon started with its standard
 // input closed), and the guard of a second start in the same process is refused.
 #include <gtest/gtest.h>

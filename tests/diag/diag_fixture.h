@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // What the DIAG tests share: the two tool calls, the log lines of a transmit-mode change and of
 // passed checks, a view of the DIAG records, and the in-process fixture (recording tools first on
 // PATH, no properties, no UART selection file).

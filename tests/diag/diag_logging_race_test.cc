@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Command 27 on the main thread against the dump threads it starts: a stop that lands in the
 // middle of a dump, and dumps asked for again and again while one runs.
 #include <stdio.h>

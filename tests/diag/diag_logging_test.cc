@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // DIAG logging control inside one process: whether logging may start, the start thread, and
 // command 27 with the dump thread it starts.
 #include <sys/socket.h>

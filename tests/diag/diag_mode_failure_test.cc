@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // DIAG logging when libdiag refuses every buffering mode (KESTREL_DIAG_TX_MODE_RESULT 0, set
 // before the stand-in reads its environment): a dump whose mode 0 fails still stops the tool,
 // and its restart failing at mode 2 leaves the state at 3, so later dumps find logging running.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // kestreld as a process, for what only a running daemon shows: its start-up and the exit status
 // of each start-up failure, the receive loop walking real datagrams, the start-up thread's opens
 // of the sensor service and a broken link's reopen tries, frames lost to an absent kernel, and

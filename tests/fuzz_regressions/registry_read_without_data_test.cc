@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Found by the sensor_reg fuzz target: a registry line "read_error <item> = 0" makes
 // sensor_reg_read report success while it hands over no buffer and length 0. Command 4 must take
 // such an item as one of no bytes (value 0, the word left as it is) and still report, byte for

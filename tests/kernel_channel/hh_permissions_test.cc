@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Command 36: the four shell commands that repair the owner and mode of the light sensor's
 // coefficient files, each finished before the next, all between the two log lines.
 #include <android/log.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Sending a frame when one of its blocks cannot be allocated: the block's line, the others freed,
 // and nothing sent. The frames that do go
 // out are compared byte for byte wherever the daemon sends one.

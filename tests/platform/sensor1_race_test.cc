@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The sensor1 library under concurrent use: writers on several threads sharing one connection
 // while the library thread delivers a flood of indications, and a close racing the deliveries.
 #include <gtest/gtest.h>

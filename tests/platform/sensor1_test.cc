@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The sensor1 library of the host build against a scripted sensor processor (the simulator, or a
 // raw socket peer where the bytes on the wire matter).
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The sensors-registry stand-in's parser on its own: its tolerance of input that is not a registry.
 // What it serves of a good file is driven through the daemon's registry reads.
 #include <gtest/gtest.h>

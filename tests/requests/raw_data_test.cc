@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Raw-data streams: the sensor manager's report request byte for byte, the light sensor's
 // driver requests, the stop replies, the magnetometer's once-only steps and the sensitivities its
 // samples are converted with, and a stream of the healthy phone from start to stop.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Register access and device controls: the magnetometer's fuse-ROM and register reads with their
 // replies, the accelerometer's filter, the motor state and the register dumps.
 #include "requests/register_access.h"

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Every sensor1 request the daemon makes, through the fault knobs of the sensor1 stand-in: the
 // allocation fails; the write returns 11 (EWOULDBLOCK, which counts as sent); the write fails
 // with another error, after which the closing requests give up the connection (the next command

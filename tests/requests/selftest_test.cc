@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Self tests: the test request of every test type, the replies built from the stored results
 // (type 9, the gyroscope's types 14 and 10), and what a missing or late answer does to them.
 #include <limits.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The status request and its reply, and the sensor-state request of command 27.
 #include "requests/status_requests.h"
 #include "request_fixture.h"

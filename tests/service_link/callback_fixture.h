@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The service callback reached as the library reaches it, from any of the test's threads, with
 // the daemon's records and frames at hand, on the DIAG tests' fixture (recording shell tools first
 // on PATH, no properties).

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The callback on the library's thread against the daemon's others: a broken link torn down and
 // rebuilt (DIAG logging stopped and restarted as the debug level allows, a new coefficient
 // refresh) while other threads open, write and close, results handed to a waiting main thread,

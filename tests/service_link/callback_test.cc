@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The service callback on the test's thread, as the library calls it: the entry and exit rules,
 // each response's lines and frames byte for byte, test results into the store and the waiter,
 // samples and DAF data out as frames of type 2, and bodies shorter than their layout refused or

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Sample conversion on its own, with nothing but the arithmetic: the rows of each sensor, the
 // precision each product is taken in, and T(), whose truncation and saturation a compiler or a
 // CPU could get differently (x86-64 and ARM convert an out-of-range double to int differently).

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The kestrel-sim program: serves the socket as a healthy phone, prints what it answers, refuses
 // and drops connections when asked, and stops cleanly on SIGTERM.
 #include <fcntl.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The phone's table of requests: what each kind of request says in the trace, and which requests
 // break the rules of what the daemon may write (size, transaction id, fixed bytes).
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 #include "daemon_fixture.h"
 
 #include "diag/diag_logging.h"

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // In-process fixture: the daemon's library with its kernel channel on a real netlink socket in
 // this test's private network namespace, the kernel driver played by a KernelPort, the sensor
 // processor by an in-process Simulator on the sensor1 socket, and every log record captured.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Frames as kestreld sends them to the kernel, built byte by byte for the tests to compare.
 #pragma once
 

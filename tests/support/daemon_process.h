@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Runs kestreld as a child process (in the test's own network namespace) with its stderr in a
 // file, and reads its log records from there, as Debian's liblog writes them:
 //   KESTRELD <P> <MM-DD> <HH:MM:SS> <pid> <tid> <message>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Captures every record logged in this process through liblog, by installing a logger.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The fixture of the tests that drive the daemon's sensor1 requests against the in-process sensor
 // processor: request bodies and kernel frames built byte by byte, test indications sent on
 // demand, and the daemon's own lines without the service callback's.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // A sensor1 client for tests of the library and the simulator: a connection whose callback
 // records every delivery (type, header, body bytes) and releases the body as the daemon does.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The environment every test binary runs in. test_main sets it before anything reads it, so
 // in-process code and the daemons a test starts see the same files:
 //   KESTREL_SENSOR1_SOCKET, KESTREL_PROPERTIES, KESTREL_SENSOR_REG and KESTREL_SYSROOT name

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Shared main of the test binaries: the environment first, then GoogleTest.
 #include <gmock/gmock.h>
 #include <signal.h>

@@ -1,4 +1,5 @@
 #!/usr/bin/env bash
+# SPDX-License-Identifier: Apache-2.0
 # Captures end to end, on the demo's factory session: tshark with the dissector finds every frame
 # kestrelctl printed, with its length, and shows the fields `kestrelctl decode --json` prints;
 # decode skips other protocols' packets and stops at a cut packet or a cut file, naming it, and

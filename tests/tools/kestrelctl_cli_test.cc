@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // kestrelctl end to end: the test plays kestreld on netlink port 20000, runs the program,
 // checks the frame it sent, answers, and checks what it printed and its exit status.
 #include <gtest/gtest.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // kestrelctl's library: command frames byte for byte, the decoding of every frame type the
 // daemon sends (text and JSON), the parsing of sensors and numbers, and the help of the tables.
 #include <gmock/gmock.h>

@@ -1,4 +1,5 @@
 #!/bin/bash
+# SPDX-License-Identifier: Apache-2.0
 # The checks inside the VM of `make vm-test`: kestreld with the phone's netlink values (protocol
 # 23, the kernel at port id 0) against the factory driver module, driven through its device.
 # One PASS/FAIL line a check on stdout; the details, the captures, the daemon's logs and the

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Captures of the kernel channel, in the pcap format tcpdump writes on a netlink monitor (nlmon)
 // device, so that a capture taken on a workstation and one taken on the phone read alike in
 // kestrelctl, tcpdump, tshark and Wireshark. libpcap writes and reads the files.

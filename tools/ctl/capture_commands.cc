@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The commands that read captures of the kernel channel: a file, or an interface live.
 #include <signal.h>
 #include <stdio.h>

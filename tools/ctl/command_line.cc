@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // kestrelctl's command line by its tables: the options, the command and its arguments, the help.
 #include <algorithm>
 

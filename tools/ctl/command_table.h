@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // kestrelctl's commands, one table: the help, the dispatch and every usage error come from it.
 #pragma once
 

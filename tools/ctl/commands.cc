@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The tables of kestrelctl: its commands and its options, with their help.
 #include <math.h>
 #include <stdlib.h>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The commands that send one frame to the daemon and, for most, wait for its reply.
 #include <array>
 #include <set>

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Kernel frames as the factory driver builds and receives them: command frames for the daemon,
 // the walk that splits a received datagram into frames, and the hex text the tool reads and
 // prints. Layouts and numbers come from kernel_frame.h.

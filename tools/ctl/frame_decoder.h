@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Decoding of the frames the daemon sends to the kernel factory driver, to readable text and to
 // one-line JSON for the scripts of the test stations.
 //

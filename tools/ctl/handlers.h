@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The handlers of kestrelctl's commands, by what they do: exchanges of command frames, streams
 // and listens, captures.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The kernel's end of the kernel channel, over one of two transports. By default a netlink socket
 // of the daemon's protocol that sends command frames to the daemon's port id and, when bound to
 // the kernel's port id, receives the frames the daemon sends to the kernel: kestrelctl and the

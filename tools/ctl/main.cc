@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // kestrelctl: plays the kernel factory driver for kestreld on a workstation. It sends command
 // frames to the daemon's netlink port and prints, decoded, the frames the daemon sends back to
 // the kernel's port. Its commands and options are the tables of commands.cc.

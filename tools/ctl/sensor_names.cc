@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 #include "sensor_names.h"
 
 #include "kernel_sensors.h"

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Sensors and numbers on kestrelctl's command line, and the names of sensor_types and sensor codes
 // (kernel_sensors.h) in what it prints.
 #pragma once

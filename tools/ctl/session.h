@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // One run of kestrelctl: its options, the kernel port it plays the kernel through, the capture it
 // keeps, and the ways of sending, waiting and printing that its commands share.
 #pragma once

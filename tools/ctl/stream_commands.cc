@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The commands that take frames as they come: a stream of samples, and a listen.
 #include <stdio.h>
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 #include "stream_plot.h"
 
 #include <errno.h>

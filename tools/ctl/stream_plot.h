@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The samples of a stream (frame 2) over time, written as CSV or drawn by gnuplot (PNG or SVG) in
 // the physical units of their sensor (sample_scale).
 #pragma once

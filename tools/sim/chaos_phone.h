@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // A sensor processor under chaos: the healthy phone's answers, spoiled by a seeded random schedule
 // of the faults a real link shows in bursts and at the worst moments. The connection is dropped at
 // random moments, as a request arrives and while the daemon waits for its answer; opens are

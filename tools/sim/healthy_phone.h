@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The healthy phone: answers every request of the daemon the way a working sensor processor
 // would, with values a factory engineer recognises (gravity on the accelerometer's z axis, a
 // still gyroscope, the earth's field on the magnetometer, sea-level air pressure, passing self

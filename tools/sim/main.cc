@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // kestrel-sim: the sensor processor of the host build. Serves the sensor1 socket as a healthy
 // phone and prints one line per request it answers, so a demo or a tester can watch the daemon
 // talk to the sensors.

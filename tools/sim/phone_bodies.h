@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The bodies the sensor service sends, built through the records the daemon reads them by: the
 // indications, the common response and the responses that carry data. Shared by the phone model,
 // the tests and the fuzz seeds.

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The simulated sensor processor's core: the connections, whichever transport carries them
 // (transport.h), the OPEN handshake with its knobs, every WRITE recorded and handed to the request
 // hook and the healthy phone. Records to the library are sent from whichever thread asks, through

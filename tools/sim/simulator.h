@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // kestrel-sim: the simulated sensor processor. It serves the sensor1 wire protocol of the host
 // build on a Unix stream socket. Tests drive it step by step (expect a request, answer it,
 // inject a fault, drop the connection, refuse opens); the kestrel-sim program runs it as a

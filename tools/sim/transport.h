@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The ways the library's connections reach the simulator: a Unix socket that a thread of the
 // simulator listens on and reads, or the library in this process, which hands each record over
 // on its caller's thread. Each connection's far end is a Channel; the simulator's core sees only

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // kestrel-chaos: kestreld under a seeded random schedule of link faults and commands.
 //
 // The daemon runs as a child process (meant to be started inside a private network namespace,

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The commands of every kind the daemon serves.
 #include "tools/soak/command_cycle.h"
 

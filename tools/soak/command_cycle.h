@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The commands kestrel-soak and kestrel-chaos send: every kind the daemon serves, with the frame
 // type of the reply a healthy phone brings.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The daemon as a child process: its run directory, environment, start and end, and its log file.
 #include "tools/soak/daemon_driver.h"
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The daemon as a child process, as kestrel-soak, kestrel-chaos and the benchmarks run it: a run
 // directory of its own, the daemon's environment, the child started and ended, and the log it
 // writes to a file, read as it grows. Everything is meant to run inside a private network

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // What /proc tells of a running process.
 #include "tools/soak/proc_readings.h"
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // What /proc tells of a running process: its memory, threads and descriptors, and the CPU time
 // and context switches of its threads.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // kestrel-soak: runs kestreld for a long stretch of work and checks that nothing accumulates.
 //
 // The daemon runs as a child process (meant to be started inside a private network namespace,

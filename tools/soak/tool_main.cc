@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // A tool's command line and its main.
 #include "tools/soak/tool_main.h"
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // A tool's command line, as a table of options, and its main.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The checks of a tool's run and its verdict.
 #include "tools/soak/verdicts.h"
 

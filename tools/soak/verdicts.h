@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // The checks of a tool's run, each printed as it is made ("ok" or "MISS"), and the run's verdict.
 #pragma once
 

@@ -1,3 +1,4 @@
+-- SPDX-License-Identifier: Apache-2.0
 -- Wireshark and tshark dissector for the factory channel between the kernel's factory driver and
 -- kestreld: netlink protocol 23, in captures taken on a phone's nlmon interface or written by
 -- `kestrelctl --pcap`. Every frame shows its command or frame type by name and the fields of its

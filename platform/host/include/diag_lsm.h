@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // libdiag: the calls the daemon makes to set the DIAG buffering mode of the sensor processor.
 #pragma once
 

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // sensor1 client library: the interface the daemon uses to reach the sensor manager and the
 // driver access service on the sensor processor. Same names and signatures as the phone's
 // library; the host build implements it over a Unix socket to kestrel-sim.

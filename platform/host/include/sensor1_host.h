@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Host-only additions of the sensor1 stand-in, for tests, fuzzers and kestrel-sim. The daemon never
 // includes this file.
 //

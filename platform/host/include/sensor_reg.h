@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Sensors registry client library (libsensor_reg): factory calibration items by id.
 #pragma once
 

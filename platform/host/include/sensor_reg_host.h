@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // Host-only addition of the sensors-registry stand-in, for tests and fuzzing. The daemon never
 // includes this file.
 #pragma once

@@ -1,3 +1,4 @@
+// SPDX-License-Identifier: Apache-2.0
 // System properties, as bionic offers them on the phone.
 #pragma once
 
