@@ -193,6 +193,47 @@ void ChaosPhone::on_request(const Request& r) {
   }
 }
 
+// Applies one link fault of the schedule; false when the library did not acknowledge it.
+bool ChaosPhone::apply_link_fault(ChaosFault fault, int extra) {
+  bool done = true;
+  switch (fault) {
+    case ChaosFault::kDrop:
+      sim_.drop_connection();
+      break;
+    case ChaosFault::kRefusedOpens:
+      sim_.refuse_opens(extra % 2 == 0 ? kEwouldblock : 5, 1 + extra % kMaxRefusedRun);
+      sim_.drop_connection();
+      break;
+    case ChaosFault::kAllocFault:
+      done = sim_.fault(FaultOp::kAlloc, 12, 1 + extra % 3, std::chrono::milliseconds(500));
+      break;
+    case ChaosFault::kWriteFault:
+      done = sim_.fault(FaultOp::kWrite, extra % 3 == 0 ? kEwouldblock : 5, 1 + extra % 2,
+                        std::chrono::milliseconds(500));
+      break;
+    case ChaosFault::kCloseFault:
+      done = sim_.fault(FaultOp::kClose, settings_.close_status, 1, std::chrono::milliseconds(500));
+      break;
+    case ChaosFault::kHeldOpen: {
+      // From half a second to five of the daemon's time: often past the three tries of its
+      // reopen, so another thread's command may be the one that opens. Every other time the
+      // link is reported broken while the open is held.
+      const auto hold = std::chrono::duration_cast<Millis>(
+          std::chrono::duration<double, std::milli>((500 + extra * 9 / 2) * settings_.time_scale));
+      sim_.hold_opens(hold, 1);
+      sim_.drop_connection();
+      if (extra % 2 == 0 && sim_.wait_for_held_open(Millis(2000) + hold)) {
+        sim_.callback_to_held_open(250, true, false, Header{}, {});
+      }
+      break;
+    }
+    default:  // RETRY_OPEN
+      sim_.retry_open();
+      break;
+  }
+  return done;
+}
+
 void ChaosPhone::run_schedule() {
   std::unique_lock<std::mutex> lock(mu_);
   for (;;) {
@@ -213,45 +254,7 @@ void ChaosPhone::run_schedule() {
     }
     if (fault == ChaosFault::kRefusedOpens) opened_at_last_refusal_ = sim_.opened_connections();
     lock.unlock();
-    bool done = true;
-    switch (fault) {
-      case ChaosFault::kDrop:
-        sim_.drop_connection();
-        break;
-      case ChaosFault::kRefusedOpens:
-        sim_.refuse_opens(extra % 2 == 0 ? kEwouldblock : 5, 1 + extra % kMaxRefusedRun);
-        sim_.drop_connection();
-        break;
-      case ChaosFault::kAllocFault:
-        done = sim_.fault(FaultOp::kAlloc, 12, 1 + extra % 3, std::chrono::milliseconds(500));
-        break;
-      case ChaosFault::kWriteFault:
-        done = sim_.fault(FaultOp::kWrite, extra % 3 == 0 ? kEwouldblock : 5, 1 + extra % 2,
-                          std::chrono::milliseconds(500));
-        break;
-      case ChaosFault::kCloseFault:
-        done =
-            sim_.fault(FaultOp::kClose, settings_.close_status, 1, std::chrono::milliseconds(500));
-        break;
-      case ChaosFault::kHeldOpen: {
-        // From half a second to five of the daemon's time: often past the three tries of its
-        // reopen, so another thread's command may be the one that opens. Every other time the
-        // link is reported broken while the open is held.
-        const auto hold =
-            std::chrono::duration_cast<Millis>(std::chrono::duration<double, std::milli>(
-                (500 + extra * 9 / 2) * settings_.time_scale));
-        sim_.hold_opens(hold, 1);
-        sim_.drop_connection();
-        if (extra % 2 == 0 && sim_.wait_for_held_open(Millis(2000) + hold)) {
-          sim_.callback_to_held_open(250, true, false, Header{}, {});
-        }
-        break;
-      }
-      default:  // RETRY_OPEN
-        sim_.retry_open();
-        break;
-    }
-    if (done) count(fault);
+    if (apply_link_fault(fault, extra)) count(fault);
     lock.lock();
   }
 }

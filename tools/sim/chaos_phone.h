@@ -76,6 +76,7 @@ class ChaosPhone {
  private:
   using Action = std::function<void()>;
   void on_request(const Request& request);
+  bool apply_link_fault(ChaosFault fault, int extra);
   void run_schedule();
   void run_timers();
   void later(std::chrono::microseconds delay, Action action);
