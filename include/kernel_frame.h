@@ -97,6 +97,19 @@ constexpr bool is_bigdata_command(uint32_t command) {
   return bigdata_kind_of(command) != nullptr;
 }
 
+// The lowest and highest daf_request_id of the kinds answered as frame reply_frame: the driver
+// answers those ids with threshold words.
+constexpr uint32_t bigdata_request_id_bound(int32_t reply_frame, bool highest) {
+  uint32_t bound = highest ? 0 : UINT32_MAX;
+  for (const bigdata_kind& kind : kBigdataKinds) {
+    if (kind.reply_frame != reply_frame) continue;
+    if (highest ? kind.daf_request_id > bound : kind.daf_request_id < bound) {
+      bound = kind.daf_request_id;
+    }
+  }
+  return bound;
+}
+
 // nlmsg_len of an outbound frame: NLMSG_SPACE of the payload, alignment bytes included.
 constexpr uint32_t frame_space(uint32_t payload_length) {
   return (payload_length + kFrameHeaderSize + 3) & ~3u;

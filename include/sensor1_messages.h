@@ -98,12 +98,6 @@ constexpr uint32_t kDafHiddenHole = 100010;
 constexpr uint32_t kDafMotorEnabled = 100011;
 constexpr uint32_t kDafMotorDisabled = 100012;
 constexpr uint32_t kDafRegisterDump = 100015;
-// Bulk-data requests whose responses carry threshold words (txn 167) or hidden-hole thresholds
-// (txn 168).
-constexpr uint32_t kDafThresholdFirst = 100006;
-constexpr uint32_t kDafThresholdLast = 100007;
-constexpr uint32_t kDafHdThresholdFirst = 100008;
-constexpr uint32_t kDafHdThresholdLast = 100009;
 
 // SNS_SMGR_REPORT_REQ_V01: service 0, msg 2, 272 bytes, txn 2. Offsets of the written fields.
 constexpr uint16_t kReportRequestSize = 272;

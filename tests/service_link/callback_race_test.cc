@@ -40,10 +40,9 @@ Bytes dump_body(int index, int round) {
 class ToolGate {
  public:
   explicit ToolGate(const FakeTools& tools) : go_(tools.dir() + "/go") {
-    write_file(tools.dir() + "/diag_mdlog", "#!/bin/sh\necho \"diag_mdlog $*\" >> " + tools.dir() +
-                                                "/calls\ni=0\nwhile [ ! -e " + go_ +
-                                                " ] && [ $i -lt 2000 ]; do sleep 0.01; " +
-                                                "i=$((i+1)); done\n");
+    write_file(tools.dir() + "/diag_mdlog",
+               "#!/bin/sh\necho \"diag_mdlog $*\" >> " + tools.dir() + "/calls\ni=0\nuntil [ -e " +
+                   go_ + " ] || [ $i -ge 2000 ]; do sleep 0.01; " + "i=$((i+1)); done\n");
   }
   ~ToolGate() { open(); }
   void open() { write_file(go_, ""); }

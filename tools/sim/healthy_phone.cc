@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <climits>
 
+#include "kernel_frame.h"
 #include "sensor1_messages.h"
 #include "tools/sim/phone_bodies.h"
 
@@ -133,6 +134,12 @@ struct DafKind {
   uint8_t code;               // indication code of the polling started or stopped
   daf_thresholds thresholds;  // words of the response
 };
+// The bulk-data ids the driver answers with threshold words, as the daemon's family table has them.
+constexpr uint32_t kDafThresholdFirst = bigdata_request_id_bound(FRAME_THRESHOLD, false);
+constexpr uint32_t kDafThresholdLast = bigdata_request_id_bound(FRAME_THRESHOLD, true);
+constexpr uint32_t kDafHdThresholdFirst = bigdata_request_id_bound(FRAME_HD_THRESHOLD, false);
+constexpr uint32_t kDafHdThresholdLast = bigdata_request_id_bound(FRAME_HD_THRESHOLD, true);
+
 const DafKind kDafKinds[] = {
     {kDafLightStreamStart,
      kDafLightStreamStart,
